@@ -1,0 +1,56 @@
+# The two commands of the README, and the steps they are made of.
+PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libsystemd-dev libgtest-dev \
+            libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-14-dev \
+            clang-format pkg-config
+FUZZ_SECONDS ?= 60
+
+.PHONY: all deps build run test test-asan fuzz bench format clean
+
+all: build
+
+# Installs only what is missing, so a prepared machine starts at once.
+deps:
+	@dpkg -s $(PACKAGES) >/dev/null 2>&1 || { \
+	  apt-get update && DEBIAN_FRONTEND=noninteractive apt-get install -y $(PACKAGES); }
+
+build/build.ninja:
+	cmake -S . -B build -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo
+
+build: deps build/build.ninja
+	cmake --build build
+
+run: build
+	./build/torvad -d examples/demo -- ./build/peer_example
+
+test: build
+	ctest --test-dir build --output-on-failure -j2
+	$(MAKE) test-asan
+	$(MAKE) fuzz
+
+build-asan/build.ninja:
+	cmake -S . -B build-asan -G Ninja -DCMAKE_BUILD_TYPE=Debug -DTORVAD_SANITIZE=ON
+
+test-asan: deps build-asan/build.ninja
+	cmake --build build-asan
+	ASAN_OPTIONS=detect_leaks=1 UBSAN_OPTIONS=halt_on_error=1:print_stacktrace=1 \
+	  ctest --test-dir build-asan --output-on-failure -j2
+
+build-fuzz/build.ninja:
+	CXX=clang++ cmake -S . -B build-fuzz -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+	  -DTORVAD_FUZZ=ON -DTORVAD_SANITIZE=ON
+
+fuzz: deps build-fuzz/build.ninja
+	cmake --build build-fuzz --target fuzz_framing
+	mkdir -p build-fuzz/corpus
+	./build-fuzz/fuzz/fuzz_framing -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	  build-fuzz/corpus fuzz/seeds
+
+bench: build
+	./build/bench/bench_framing
+	./build/bench/bench_restart
+
+format:
+	clang-format -i $$(git ls-files '*.cpp' '*.hpp')
+
+clean:
+	rm -rf build build-asan build-fuzz

@@ -1,0 +1,82 @@
+// torvad: supervises the product's programs. main reads as its steps.
+#include <csignal>
+#include <cstdio>
+
+#include <boost/filesystem/operations.hpp>
+
+#include "daemon/daemon.hpp"
+#include "entry/command_line.hpp"
+#include "entry/service.hpp"
+#include "platform/platform.hpp"
+#include "process/process.hpp"
+
+using namespace torvad;
+
+namespace {
+
+// The name is made absolute before the working directory changes, so that the
+// removal at the end reaches the file this run created.
+std::string write_pid_file(const char* name) {
+    if (name == nullptr)
+        return {};
+    std::string path = platform::absolute_path(name);
+    if (platform::write_pid_file(path, platform::current_process_id()))
+        return path;
+    the_daemon.log_error("failed to create pid file");
+    return {};
+}
+
+void choose_what_to_supervise(command_line& options) {
+    if (options.command.empty() && options.attach_pid == 0)
+        return;
+    auto top = process::create(&the_daemon, std::move(options.command), std::move(options.user),
+                               ".", {}, true, stdio_inherit);
+    if (options.attach_pid != 0)
+        top->attach(options.attach_pid, options.attach_pipe);
+    the_daemon.configure("torvad", nullptr);
+}
+
+void run_at_console() {
+    // At a console a plain kill is a stop request too.
+    the_daemon.signals.add(SIGTERM);
+    the_daemon.start();
+    the_daemon.run();
+}
+
+} // namespace
+
+int main(int argc, char** argv) {
+    platform::ensure_standard_descriptors();
+    platform::ignore_broken_pipes();
+    // A line is worth seeing at once, also when stdout is a pipe or a journal.
+    std::setvbuf(stdout, nullptr, _IOLBF, 0);
+    background = !platform::stdout_is_terminal();
+
+    command_line options = scan_command_line(argc, argv);
+    if (options.help) {
+        std::fputs(help_text(argv[0]).c_str(), stderr);
+        return 0;
+    }
+    verbose = options.verbose;
+    logging = options.logging;
+    background = background || options.background;
+    auto_restart = !options.no_restart;
+
+    std::string pid_file = write_pid_file(options.pid_file);
+    boost::filesystem::path exe_path = platform::absolute_path(argv[0]);
+    if (options.directory.empty())
+        options.directory = exe_path.parent_path().string();
+    platform::change_directory(options.directory);
+
+    choose_what_to_supervise(options);
+    the_daemon.program_name = exe_path.filename().string();
+
+    if (!background)
+        run_at_console();
+    else
+        platform::run_service_dispatcher(run_service, service_control_stop);
+
+    if (!pid_file.empty())
+        platform::remove_file(pid_file);
+    return 0;
+}

@@ -1,0 +1,79 @@
+// The end of a child: its exit, the restart rule, and leaving the daemon.
+#include "process/process.hpp"
+
+#include <boost/asio/post.hpp>
+
+#include "daemon/daemon.hpp"
+#include "ipc/packet.hpp"
+#include "platform/platform.hpp"
+
+namespace torvad {
+
+namespace {
+// A child killed by a signal counts as failed, as the shell reports it.
+constexpr std::uint32_t signal_status_base = 128;
+} // namespace
+
+void process::on_exit(const boost::system::error_code& error) {
+    // Only a closing handle ends the wait with an error, and then the object
+    // may be gone: touch nothing.
+    if (error)
+        return;
+    platform::exit_status exit = platform::reap_child(process_handle.native_handle());
+    std::uint32_t code = static_cast<std::uint32_t>(exit.code);
+    if (!exit.exited)
+        code = forced ? 0 : signal_status_base + code;
+    finish(code, packet_closed);
+}
+
+void process::close_pipes() {
+    for (auto* pipe : {&stdin_pipe, &stdout_pipe, &stderr_pipe})
+        if (*pipe)
+            (*pipe)->close();
+}
+
+void process::finish(std::uint32_t exit_status, std::uint32_t end) {
+    end_packet = end;
+    status = exit_status;
+    // Closing ends the pending reads and writes before their queues go.
+    close_pipes();
+    ipc_pipe.close();
+    stdin_close_requested = false;
+    stdin_queue.clear();
+    ipc_queue.clear();
+    ipc_fill = 0;
+    channels.clear();
+    if (end_packet == packet_closed) {
+        if (status == 0)
+            owner->log_info("'%s' exited with 0x%x.", name.c_str(), status);
+        else
+            owner->log_warning("'%s' exited with 0x%x.", name.c_str(), status);
+        if (status != 0 && auto_restart && persistent) {
+            owner->log_info("starting '%s' again.", name.c_str());
+            // The successor is in children before we leave, so the run never
+            // looks empty across a restart.
+            process::create(owner, command, user, working_directory, {parent, channel},
+                            persistent, stdio_mode)
+                ->start();
+        }
+    }
+    // Completions that were already queued when the pipes closed still run and
+    // may hold a plain pointer to us; this handler, queued behind them, keeps
+    // the object alive until they have.
+    auto self = shared_from_this();
+    boost::asio::post(*owner, [self] {});
+    owner->remove(self);
+}
+
+void process::terminate() {
+    if (persistent) {
+        send_packet(0, packet_sigterm, 0, nullptr, 0);
+        return;
+    }
+    if (process_handle.is_open()) {
+        forced = true;
+        platform::kill_child(process_handle.native_handle());
+    }
+}
+
+} // namespace torvad

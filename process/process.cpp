@@ -1,0 +1,56 @@
+// Construction and destruction of a process: entering the daemon's set, and
+// the one closing packet every channel owes its parent.
+#include "process/process.hpp"
+
+#include <boost/filesystem/path.hpp>
+
+#include "daemon/daemon.hpp"
+#include "ipc/packet.hpp"
+
+namespace torvad {
+
+process::process(daemon* owner, std::vector<std::string> command, std::string user,
+                 std::string working_directory, channel_ref ref, bool persistent,
+                 std::int32_t stdio_mode)
+    : owner(owner), command(std::move(command)), user(std::move(user)),
+      working_directory(std::move(working_directory)), parent(std::move(ref.parent)),
+      channel(ref.channel), persistent(persistent), stdio_mode(stdio_mode),
+      process_handle(*owner), end_packet(packet_failed), ipc_pipe(*owner) {
+    // Pipes are relayed to a parent; without a living one there is nowhere to go.
+    if (this->stdio_mode == stdio_pipes && parent.expired())
+        this->stdio_mode = stdio_none;
+    if (!this->command.empty())
+        name = boost::filesystem::path(this->command[0]).filename().string();
+}
+
+std::shared_ptr<process> process::create(daemon* owner, std::vector<std::string> command,
+                                         std::string user, std::string working_directory,
+                                         channel_ref ref, bool persistent,
+                                         std::int32_t stdio_mode) {
+    std::shared_ptr<process> created(new process(owner, std::move(command), std::move(user),
+                                                 std::move(working_directory), std::move(ref),
+                                                 persistent, stdio_mode));
+    // The set is the owner from here on, so create never hands out a child
+    // that the daemon doesn't know.
+    owner->children.insert(created);
+    return created;
+}
+
+std::shared_ptr<process> process::spawn(daemon* owner, std::vector<std::string> command,
+                                        std::string user, std::string working_directory,
+                                        channel_ref ref, bool persistent,
+                                        std::int32_t stdio_mode) {
+    return create(owner, std::move(command), std::move(user), std::move(working_directory),
+                  std::move(ref), persistent, stdio_mode);
+}
+
+process::~process() {
+    // Runs after every pending read has completed, so this packet follows all
+    // of the channel's output.
+    if (auto requester = parent.lock()) {
+        requester->send_packet(channel, end_packet, status, nullptr, 0);
+        requester->channels.erase(channel);
+    }
+}
+
+} // namespace torvad
