@@ -61,7 +61,9 @@ void daemon::terminate_children() {
     auto_restart = false;
 }
 
-void daemon::stop() { terminate_children(); }
+void daemon::stop() {
+    terminate_children();
+}
 
 void daemon::on_signal(const boost::system::error_code& error, int /*signal_number*/) {
     if (error)

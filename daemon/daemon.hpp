@@ -38,8 +38,7 @@ class daemon : public boost::asio::io_context {
     daemon& operator=(const daemon&) = delete;
 
     virtual void log_line(event_type type, int colour_number, const char* text);
-    virtual void log_format(event_type type, int colour_number, const char* format,
-                            va_list args);
+    virtual void log_format(event_type type, int colour_number, const char* format, va_list args);
     void log_error(const char* format, ...) __attribute__((format(printf, 2, 3)));
     void log_warning(const char* format, ...) __attribute__((format(printf, 2, 3)));
     void log_info(const char* format, ...) __attribute__((format(printf, 2, 3)));

@@ -38,13 +38,27 @@ command_line scan_command_line(int argc, char** argv) {
         case 'h':
             options.help = true;
             return options;
-        case 'v': options.verbose = true; break;
-        case 'l': options.logging = true; break;
-        case 'b': options.background = true; break;
-        case 'o': options.no_restart = true; break;
-        case 'f': take_string(argc, argv, i, options.family); break;
-        case 'u': take_string(argc, argv, i, options.user); break;
-        case 'd': take_string(argc, argv, i, options.directory); break;
+        case 'v':
+            options.verbose = true;
+            break;
+        case 'l':
+            options.logging = true;
+            break;
+        case 'b':
+            options.background = true;
+            break;
+        case 'o':
+            options.no_restart = true;
+            break;
+        case 'f':
+            take_string(argc, argv, i, options.family);
+            break;
+        case 'u':
+            take_string(argc, argv, i, options.user);
+            break;
+        case 'd':
+            take_string(argc, argv, i, options.directory);
+            break;
         case 'p':
             if (take_value(argc, argv, i, value))
                 options.pid_file = value;

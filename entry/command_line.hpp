@@ -10,8 +10,8 @@ struct command_line {
     bool help = false;
     bool verbose = false;
     bool logging = false;
-    bool background = false;  // -b; main ors in "stdout is not a terminal"
-    bool no_restart = false;  // -o
+    bool background = false; // -b; main ors in "stdout is not a terminal"
+    bool no_restart = false; // -o
     std::string family = "torvaSentry";
     std::string user;
     std::string directory;

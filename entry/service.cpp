@@ -30,6 +30,8 @@ void run_service() {
     platform::report_service_state(service_state::stopped);
 }
 
-void service_control_stop() { the_daemon.io_context::stop(); }
+void service_control_stop() {
+    the_daemon.io_context::stop();
+}
 
 } // namespace torvad

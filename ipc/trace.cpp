@@ -104,10 +104,9 @@ void process::trace_packet(const char* packet, bool sent) {
         return;
     trace_text text = describe_packet(packet);
     std::string label = channel_label(read_packet_header(packet).channel);
-    owner->log_verbose(owner->colour && !logging ? "\x1b[36m%s %s:%s\x1b[35m %s\x1b[0m %s"
-                                                 : "%s %s:%s %s %s",
-                       sent ? "->" : "<-", name.c_str(), label.c_str(), text.type_name,
-                       text.details.c_str());
+    owner->log_verbose(
+        owner->colour && !logging ? "\x1b[36m%s %s:%s\x1b[35m %s\x1b[0m %s" : "%s %s:%s %s %s",
+        sent ? "->" : "<-", name.c_str(), label.c_str(), text.type_name, text.details.c_str());
 }
 
 } // namespace torvad

@@ -87,6 +87,8 @@ void process::frame_ipc(std::uint32_t bytes) {
         trace_packet(packet, false);
         if (header.type == packet_stdin)
             route_stdin(packet);
+        else if (header.type == packet_execute)
+            handle_execute(packet);
         offset += header.length;
     }
     // One move of the unfinished tail, however many packets came in this read.

@@ -63,9 +63,9 @@ int resolve_account(const std::string& user, account& out);
 enum class stdio_source { inherit, descriptors, null_device };
 
 struct launch_request {
-    std::string executable;         // absolute path
-    std::vector<std::string> argv;  // argv[0] included
-    std::string working_directory;  // empty: ours
+    std::string executable;        // absolute path
+    std::vector<std::string> argv; // argv[0] included
+    std::string working_directory; // empty: ours
     stdio_source stdio = stdio_source::inherit;
     int stdio_fds[3] = {-1, -1, -1}; // with stdio_source::descriptors
     int ipc_fd = -1;                 // kept open in the child at the same number
@@ -76,9 +76,9 @@ enum class launch_step { none, logon, exec };
 
 struct launch_result {
     int pid = 0;
-    int pidfd = -1;                     // owned by the caller on success
+    int pidfd = -1; // owned by the caller on success
     launch_step failed_step = launch_step::none;
-    int error = 0;                      // errno of the failed step
+    int error = 0; // errno of the failed step
 };
 
 // Forks and executes the child. The child keeps exactly fds 0, 1, 2 and ipc_fd,

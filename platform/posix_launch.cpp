@@ -129,7 +129,7 @@ void close_other_descriptors(const int (&keep)[2], int max_fd) {
     for (int target = 0; target < 3; ++target) {
         int source = request.stdio == stdio_source::descriptors   ? request.stdio_fds[target]
                      : request.stdio == stdio_source::null_device ? null_fd
-                                                                   : target;
+                                                                  : target;
         if (source != target && dup2(source, target) == -1)
             fail_in_child(status_fd, launch_step::exec);
     }
@@ -223,6 +223,8 @@ exit_status reap_child(int pidfd) {
     return {false, info.si_status};
 }
 
-void kill_child(int pidfd) { syscall(SYS_pidfd_send_signal, pidfd, SIGKILL, nullptr, 0); }
+void kill_child(int pidfd) {
+    syscall(SYS_pidfd_send_signal, pidfd, SIGKILL, nullptr, 0);
+}
 
 } // namespace torvad::platform

@@ -15,9 +15,13 @@ namespace torvad::platform {
 
 const char* const exe_suffix = "";
 
-int current_process_id() { return static_cast<int>(getpid()); }
+int current_process_id() {
+    return static_cast<int>(getpid());
+}
 
-bool stdout_is_terminal() { return isatty(STDOUT_FILENO) == 1; }
+bool stdout_is_terminal() {
+    return isatty(STDOUT_FILENO) == 1;
+}
 
 void ensure_standard_descriptors() {
     for (int fd = 0; fd < 3; ++fd) {
@@ -30,9 +34,13 @@ void ensure_standard_descriptors() {
     }
 }
 
-void ignore_broken_pipes() { signal(SIGPIPE, SIG_IGN); }
+void ignore_broken_pipes() {
+    signal(SIGPIPE, SIG_IGN);
+}
 
-bool change_directory(const std::string& path) { return chdir(path.c_str()) == 0; }
+bool change_directory(const std::string& path) {
+    return chdir(path.c_str()) == 0;
+}
 
 std::tm local_time_now() {
     std::time_t now = std::time(nullptr);
@@ -49,7 +57,9 @@ bool write_pid_file(const std::string& path, int pid) {
     return std::fclose(file) == 0;
 }
 
-void remove_file(const std::string& path) { std::remove(path.c_str()); }
+void remove_file(const std::string& path) {
+    std::remove(path.c_str());
+}
 
 std::string absolute_path(const std::string& path) {
     boost::system::error_code error;
@@ -85,6 +95,8 @@ int make_ipc_pair(int& ours, int& theirs) {
     return 0;
 }
 
-bool descriptor_is_open(int fd) { return fd >= 0 && fcntl(fd, F_GETFD) != -1; }
+bool descriptor_is_open(int fd) {
+    return fd >= 0 && fcntl(fd, F_GETFD) != -1;
+}
 
 } // namespace torvad::platform

@@ -10,6 +10,11 @@
 namespace torvad {
 
 namespace {
+// async_pipe hands out its ends as const only, but closing ours is ours to do.
+void close_write_end(boost::process::async_pipe& pipe) {
+    const_cast<boost::asio::posix::stream_descriptor&>(pipe.sink()).close();
+}
+
 // A child killed by a signal counts as failed, as the shell reports it.
 constexpr std::uint32_t signal_status_base = 128;
 } // namespace
@@ -23,7 +28,17 @@ void process::on_exit(const boost::system::error_code& error) {
     std::uint32_t code = static_cast<std::uint32_t>(exit.code);
     if (!exit.exited)
         code = forced ? 0 : signal_status_base + code;
-    finish(code, packet_closed);
+    if (open_streams == 0) {
+        finish(code, packet_closed);
+        return;
+    }
+    // All the child wrote is in its pipes now. Dropping our copies of their
+    // write ends lets the reads run to end-of-file, so nothing is lost and
+    // the closing packet still follows the last output.
+    exit_pending = true;
+    pending_status = code;
+    close_write_end(*stdout_pipe);
+    close_write_end(*stderr_pipe);
 }
 
 void process::close_pipes() {
@@ -52,8 +67,8 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
             owner->log_info("starting '%s' again.", name.c_str());
             // The successor is in children before we leave, so the run never
             // looks empty across a restart.
-            process::create(owner, command, user, working_directory, {parent, channel},
-                            persistent, stdio_mode)
+            process::create(owner, command, user, working_directory, {parent, channel}, persistent,
+                            stdio_mode)
                 ->start();
         }
     }

@@ -15,8 +15,8 @@ namespace torvad {
 
 namespace {
 
-const char* const script_wrapper[] = {"powershell", "-noprofile", "-noninteractive",
-                                      "-executionpolicy", "bypass", "-file"};
+const char* const script_wrapper[] = {"powershell",       "-noprofile", "-noninteractive",
+                                      "-executionpolicy", "bypass",     "-file"};
 
 // Applies the suffix and script rules to argv[0]; false when a bare name is
 // not found on the search path.
@@ -128,6 +128,7 @@ void process::watch_child(int pidfd, int child_pid) {
     process_handle.async_wait(boost::asio::posix::stream_descriptor::wait_read,
                               [this](const boost::system::error_code& error) { on_exit(error); });
     if (stdio_mode == stdio_pipes) {
+        open_streams = 2;
         read_output(1);
         read_output(2);
     }

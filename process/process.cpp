@@ -14,8 +14,8 @@ process::process(daemon* owner, std::vector<std::string> command, std::string us
                  std::int32_t stdio_mode)
     : owner(owner), command(std::move(command)), user(std::move(user)),
       working_directory(std::move(working_directory)), parent(std::move(ref.parent)),
-      channel(ref.channel), persistent(persistent), stdio_mode(stdio_mode),
-      process_handle(*owner), end_packet(packet_failed), ipc_pipe(*owner) {
+      channel(ref.channel), persistent(persistent), stdio_mode(stdio_mode), process_handle(*owner),
+      end_packet(packet_failed), ipc_pipe(*owner) {
     // Pipes are relayed to a parent; without a living one there is nowhere to go.
     if (this->stdio_mode == stdio_pipes && parent.expired())
         this->stdio_mode = stdio_none;
@@ -38,8 +38,7 @@ std::shared_ptr<process> process::create(daemon* owner, std::vector<std::string>
 
 std::shared_ptr<process> process::spawn(daemon* owner, std::vector<std::string> command,
                                         std::string user, std::string working_directory,
-                                        channel_ref ref, bool persistent,
-                                        std::int32_t stdio_mode) {
+                                        channel_ref ref, bool persistent, std::int32_t stdio_mode) {
     return create(owner, std::move(command), std::move(user), std::move(working_directory),
                   std::move(ref), persistent, stdio_mode);
 }

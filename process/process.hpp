@@ -65,6 +65,9 @@ class process : public std::enable_shared_from_this<process> {
     // Frames the bytes just added behind ipc_fill and acts on every whole packet.
     void frame_ipc(std::uint32_t bytes);
     void attach(std::int32_t attach_pid, int fd);
+    // execute requests (ipc/execute.cpp)
+    void handle_execute(const char* packet);
+    void send_and_forget(std::uint32_t channel, std::uint32_t type, std::uint32_t flags);
     void send_version();
     void trace_packet(const char* packet, bool sent);
 
@@ -95,6 +98,10 @@ class process : public std::enable_shared_from_this<process> {
     std::uint32_t ipc_fill = 0;
     // Set when terminate ended the child by force: such an end counts as 0.
     bool forced = false;
+    // Relayed output streams still being read; an exit waits for them to end.
+    int open_streams = 0;
+    bool exit_pending = false;
+    std::uint32_t pending_status = 0;
 
   private:
     process(daemon* owner, std::vector<std::string> command, std::string user,

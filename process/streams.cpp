@@ -16,16 +16,20 @@ void process::read_output(std::int32_t stream) {
     // The read owns the object until it completes, so the closing packet of a
     // channel can only follow output that was already read.
     pipe->async_read_some(boost::asio::buffer(buffer, sizeof stdout_buffer),
-                          [self = shared_from_this(), stream](
-                              const boost::system::error_code& error, std::size_t bytes) {
+                          [self = shared_from_this(),
+                           stream](const boost::system::error_code& error, std::size_t bytes) {
                               self->on_output(error, bytes, stream);
                           });
 }
 
 void process::on_output(const boost::system::error_code& error, std::size_t bytes,
                         std::int32_t stream) {
-    if (error)
+    if (error) {
+        // The last stream to end completes an exit that waited for the output.
+        if (--open_streams == 0 && exit_pending)
+            finish(pending_status, packet_closed);
         return;
+    }
     if (auto requester = parent.lock())
         requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0,
                                stream == 1 ? stdout_buffer : stderr_buffer,

@@ -1,1 +1,202 @@
+#include "tests/e2e/harness.hpp"
 
+#include <cerrno>
+#include <chrono>
+#include <csignal>
+#include <cstdlib>
+#include <dirent.h>
+#include <fcntl.h>
+#include <filesystem>
+#include <fstream>
+#include <poll.h>
+#include <pty.h>
+#include <sstream>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <termios.h>
+#include <unistd.h>
+
+namespace e2e {
+
+const char* const torvad_binary = TORVAD_BINARY;
+const char* const child_binary = TEST_CHILD_BINARY;
+
+namespace {
+
+using clock = std::chrono::steady_clock;
+
+int remaining_ms(clock::time_point deadline) {
+    auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - clock::now());
+    return left.count() > 0 ? static_cast<int>(left.count()) : 0;
+}
+
+// Makes the output end of the test: a raw pty (no \r\n translation) or a pipe.
+void open_output(bool terminal, int& ours, int& theirs) {
+    if (terminal) {
+        if (openpty(&ours, &theirs, nullptr, nullptr, nullptr) == -1)
+            std::abort();
+        termios mode{};
+        tcgetattr(theirs, &mode);
+        cfmakeraw(&mode);
+        tcsetattr(theirs, TCSANOW, &mode);
+    } else {
+        int fds[2];
+        if (pipe(fds) == -1)
+            std::abort();
+        ours = fds[0];
+        theirs = fds[1];
+    }
+    fcntl(ours, F_SETFD, FD_CLOEXEC);
+}
+
+[[noreturn]] void exec_daemon(const std::vector<std::string>& args, const options& how, int out) {
+    int null_fd = open("/dev/null", O_RDONLY);
+    dup2(null_fd, 0);
+    dup2(out, 1);
+    dup2(out, 2);
+    for (int fd = 3; fd < 1024; ++fd) {
+        bool keep = false;
+        for (int kept : how.inherit)
+            keep = keep || kept == fd;
+        if (!keep)
+            close(fd);
+        else
+            fcntl(fd, F_SETFD, 0);
+    }
+    if (!how.directory.empty() && chdir(how.directory.c_str()) == -1)
+        _exit(126);
+    unsetenv("NOTIFY_SOCKET");
+    for (const auto& entry : how.env)
+        putenv(const_cast<char*>(entry.c_str()));
+    std::vector<char*> argv{const_cast<char*>(torvad_binary)};
+    for (const auto& arg : args)
+        argv.push_back(const_cast<char*>(arg.c_str()));
+    argv.push_back(nullptr);
+    execv(torvad_binary, argv.data());
+    _exit(127);
+}
+
+} // namespace
+
+daemon_run::daemon_run(const std::vector<std::string>& args, const options& how) {
+    int theirs = -1;
+    open_output(how.terminal, out_fd_, theirs);
+    pid_ = fork();
+    if (pid_ == 0)
+        exec_daemon(args, how, theirs);
+    close(theirs);
+}
+
+daemon_run::~daemon_run() {
+    if (!exited_) {
+        kill(pid_, SIGKILL);
+        waitpid(pid_, nullptr, 0);
+    }
+    close(out_fd_);
+}
+
+bool daemon_run::read_some(int timeout_ms) {
+    if (eof_)
+        return false;
+    pollfd ready{out_fd_, POLLIN, 0};
+    if (poll(&ready, 1, timeout_ms) <= 0)
+        return false;
+    char buffer[4096];
+    ssize_t got = read(out_fd_, buffer, sizeof buffer);
+    if (got <= 0) {
+        eof_ = true; // a pty gives EIO once every writer has gone
+        return false;
+    }
+    output_.append(buffer, got);
+    return true;
+}
+
+bool daemon_run::wait_for(const std::string& text, int timeout_ms) {
+    auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
+    for (;;) {
+        auto found = output_.find(text, cursor_);
+        if (found != std::string::npos) {
+            cursor_ = found + text.size();
+            return true;
+        }
+        if (!read_some(remaining_ms(deadline)) && (eof_ || remaining_ms(deadline) == 0))
+            return false;
+    }
+}
+
+std::string daemon_run::wait_value(const std::string& key, int timeout_ms) {
+    if (!wait_for(key + "=", timeout_ms))
+        return {};
+    std::size_t end = cursor_;
+    while (end < output_.size() && !std::isspace(static_cast<unsigned char>(output_[end])))
+        ++end;
+    std::string value = output_.substr(cursor_, end - cursor_);
+    cursor_ = end;
+    return value;
+}
+
+int daemon_run::wait_exit(int timeout_ms) {
+    auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
+    int pidfd = static_cast<int>(syscall(SYS_pidfd_open, pid_, 0));
+    while (!exited_) {
+        // Output keeps flowing while we wait, and must be drained for a pty.
+        pollfd ready[2] = {{pidfd, POLLIN, 0}, {eof_ ? -1 : out_fd_, POLLIN, 0}};
+        if (poll(ready, 2, remaining_ms(deadline)) <= 0)
+            break;
+        if (ready[1].revents != 0)
+            read_some(0);
+        int status = 0;
+        if (ready[0].revents != 0 && waitpid(pid_, &status, 0) == pid_) {
+            exited_ = true;
+            exit_code_ = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+        }
+    }
+    close(pidfd);
+    while (read_some(0)) {
+    }
+    return exited_ ? exit_code_ : -1;
+}
+
+void daemon_run::signal(int signal_number) {
+    kill(pid_, signal_number);
+}
+
+scratch_dir::scratch_dir() {
+    char name[] = "/tmp/torvad-test-XXXXXX";
+    path = mkdtemp(name);
+}
+
+scratch_dir::~scratch_dir() {
+    std::filesystem::remove_all(path);
+}
+
+bool file_exists(const std::string& path) {
+    return access(path.c_str(), F_OK) == 0;
+}
+
+std::string read_file(const std::string& path) {
+    std::ifstream file(path);
+    std::stringstream text;
+    text << file.rdbuf();
+    return text.str();
+}
+
+int zombie_children(pid_t pid) {
+    int zombies = 0;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
+        std::ifstream status(entry.path() / "status");
+        std::string line, state;
+        pid_t parent = -1;
+        while (std::getline(status, line)) {
+            if (line.rfind("State:", 0) == 0)
+                state = line;
+            if (line.rfind("PPid:", 0) == 0)
+                parent = std::atoi(line.c_str() + 5);
+        }
+        if (parent == pid && state.find('Z') != std::string::npos)
+            ++zombies;
+    }
+    return zombies;
+}
+
+} // namespace e2e

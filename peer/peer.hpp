@@ -1,0 +1,69 @@
+// The peer side of the ipc protocol, for product programs that torvad runs as
+// persistent children. A connection owns its descriptor and closes it; a
+// packet owns its payload. Nothing here throws or raises SIGPIPE.
+//
+// A peer's life: take the fd from the last argument, read `version` first,
+// then send `execute` and `stdin` packets and read what comes back, framed by
+// length, until `sigterm` arrives on channel 0; then end with status 0.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "ipc/packet.hpp"
+
+namespace torvad::peer {
+
+// The ipc fd torvad passed as the last argument, or -1 when that argument is
+// not the decimal number of an open descriptor.
+int ipc_fd_from_arguments(int argc, char** argv);
+
+struct packet {
+    packet_header header;
+    std::string payload;
+};
+
+class connection {
+  public:
+    explicit connection(int fd);
+    ~connection();
+    connection(connection&& other) noexcept;
+    connection& operator=(connection&& other) noexcept;
+    connection(const connection&) = delete;
+    connection& operator=(const connection&) = delete;
+
+    // Blocks for the next whole packet; false on end of stream, an error or a
+    // length outside 16..65536 (the stream can't be trusted after that).
+    bool receive(packet& out);
+    // Sends one packet in a single write of the whole block.
+    bool send(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+              std::string_view payload = {});
+    // Asks for items (optional user, optional path, executable, arguments) to
+    // be run as a new channel; flags are the execute_* bits.
+    bool execute(std::uint32_t channel, std::uint32_t flags, const std::vector<std::string>& items);
+    // Bytes for a channel's standard input; close ends that input after them.
+    bool send_stdin(std::uint32_t channel, std::string_view bytes, bool close = false);
+    int fd() const { return fd_; }
+
+  private:
+    bool fill();
+    int fd_ = -1;
+    std::string buffer_; // bytes read but not yet handed out
+};
+
+struct version_info {
+    std::string program_name;
+    std::string version;
+    bool background = false;
+};
+
+// The three items of a version packet; nothing when the packet isn't one.
+std::optional<version_info> parse_version(const packet& received);
+
+// Reads the first packet, which must be a valid version.
+bool read_version(connection& link, version_info& out);
+
+} // namespace torvad::peer

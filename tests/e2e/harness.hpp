@@ -1,0 +1,79 @@
+// Runs the real torvad binary for end-to-end tests: stdout on a pseudo-terminal
+// (the console path) or on a pipe (the service path), with bounded waits for
+// what it prints and for its exit.
+#pragma once
+
+#include <string>
+#include <sys/types.h>
+#include <vector>
+
+namespace e2e {
+
+extern const char* const torvad_binary;
+extern const char* const child_binary;
+
+struct options {
+    bool terminal = true;         // stdout and stderr on a pty, else a pipe
+    std::vector<int> inherit;     // extra fds the daemon keeps
+    std::vector<std::string> env; // NAME=value added to the environment
+    std::string directory;        // where it starts; empty: ours
+};
+
+inline options piped() {
+    options how;
+    how.terminal = false;
+    return how;
+}
+
+inline options in_directory(std::string directory) {
+    options how;
+    how.directory = std::move(directory);
+    return how;
+}
+
+inline options inheriting(int fd) {
+    options how;
+    how.inherit = {fd};
+    return how;
+}
+
+class daemon_run {
+  public:
+    daemon_run(const std::vector<std::string>& args, const options& how = {});
+    ~daemon_run();
+    daemon_run(const daemon_run&) = delete;
+
+    // Reads until text appears behind the cursor; moves the cursor behind it.
+    bool wait_for(const std::string& text, int timeout_ms = 10000);
+    // The value behind "key=" in the next output that holds it, e.g. a pid.
+    std::string wait_value(const std::string& key, int timeout_ms = 10000);
+    // The exit code, or -1 when it didn't end in time (it is killed then).
+    int wait_exit(int timeout_ms = 10000);
+    void signal(int signal_number);
+    pid_t pid() const { return pid_; }
+    const std::string& output() const { return output_; }
+
+  private:
+    bool read_some(int timeout_ms);
+    pid_t pid_ = -1;
+    int out_fd_ = -1;
+    bool eof_ = false;
+    bool exited_ = false;
+    int exit_code_ = -1;
+    std::string output_;
+    std::size_t cursor_ = 0;
+};
+
+// A scratch directory removed with its contents at the end of the test.
+struct scratch_dir {
+    scratch_dir();
+    ~scratch_dir();
+    std::string path;
+};
+
+bool file_exists(const std::string& path);
+std::string read_file(const std::string& path);
+// Children of pid that are zombies.
+int zombie_children(pid_t pid);
+
+} // namespace e2e

@@ -1,0 +1,134 @@
+// The ipc pipe from the far end: framing of bytes split and joined across
+// reads, bad lengths, stdin routing errors, the trace, and an attached pipe.
+#include <gtest/gtest.h>
+
+#include <csignal>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include "ipc/packet.hpp"
+#include "peer/peer.hpp"
+#include "tests/e2e/harness.hpp"
+
+using namespace e2e;
+
+namespace {
+
+// A packet as the hex the test child writes; "/" splits it into writes.
+std::string hex_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                       const std::string& payload, std::uint32_t length = 0) {
+    auto bytes = torvad::frame_packet(channel, type, flags, payload.data(), payload.size());
+    if (length != 0)
+        torvad::store_u32(reinterpret_cast<unsigned char*>(bytes.data()), length);
+    std::string hex;
+    char digits[3];
+    for (char byte : bytes) {
+        std::snprintf(digits, sizeof digits, "%02x", static_cast<unsigned char>(byte));
+        hex += digits;
+    }
+    return hex;
+}
+
+} // namespace
+
+TEST(ipc, packets_split_and_joined_across_reads_are_framed_in_order) {
+    const std::string stdin5 = hex_packet(5, torvad::packet_stdin, 0, "abc");
+    const std::string stdin6 = hex_packet(6, torvad::packet_stdin, 1, "x");
+    const std::string bad = hex_packet(7, torvad::packet_stdin, 0, "", 15);
+    struct row {
+        std::string hex;
+        std::vector<std::string> expected; // in this order
+        std::vector<std::string> absent;
+    };
+    const row rows[] = {
+        {stdin5 + stdin6,
+         {"<- test_child:5 stdin abc", "channel 0x5 does not exist",
+          "<- test_child:6 stdin x flags=0x1", "channel 0x6 does not exist"},
+         {}},
+        {stdin5.substr(0, 10) + "/" + stdin5.substr(10, 24) + "/" + stdin5.substr(34),
+         {"channel 0x5 does not exist"},
+         {}},
+        {bad + stdin5 + "/" + stdin6,
+         {"bad ipc packet length", "channel 0x6 does not exist"},
+         {"0x5", "0x7"}},
+        {hex_packet(0x500003, 9, 4, "zz") + hex_packet(1, torvad::packet_sigterm, 0, ""),
+         {"<- test_child:psfile:3 unknown \n", "<- test_child:1 sigterm \n"},
+         {}},
+    };
+    for (const auto& r : rows) {
+        daemon_run run({"-v", "-l", "--", child_binary, "raw", r.hex});
+        for (const auto& line : r.expected)
+            EXPECT_TRUE(run.wait_for(line)) << line << "\n" << run.output();
+        run.signal(SIGINT);
+        EXPECT_EQ(run.wait_exit(), 0) << run.output();
+        for (const auto& text : r.absent)
+            EXPECT_EQ(run.output().find(text), std::string::npos) << text << run.output();
+        EXPECT_NE(run.output().find("-> test_child:0 sigterm \n"), std::string::npos);
+    }
+}
+
+TEST(ipc, the_trace_is_coloured_at_a_terminal_and_absent_without_v) {
+    daemon_run coloured({"-v", "--", child_binary, "peer"});
+    EXPECT_TRUE(coloured.wait_for("\x1b[36m-> test_child:0\x1b[35m version\x1b[0m \"torvad\" "
+                                  "\"1.1.21.0\" \"Background:false\" \n"))
+        << coloured.output();
+    coloured.signal(SIGINT);
+    EXPECT_EQ(coloured.wait_exit(), 0);
+
+    daemon_run quiet({"--", child_binary, "peer"});
+    EXPECT_TRUE(quiet.wait_for("child: ready"));
+    quiet.signal(SIGINT);
+    EXPECT_EQ(quiet.wait_exit(), 0);
+    EXPECT_EQ(quiet.output().find("version\x1b"), std::string::npos) << quiet.output();
+}
+
+namespace {
+
+struct attached {
+    attached(std::vector<std::string> extra) {
+        int fds[2];
+        socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds);
+        ours = std::make_unique<torvad::peer::connection>(fds[0]);
+        std::vector<std::string> args = {"-v", "-l", "-a", "4242", std::to_string(fds[1])};
+        args.insert(args.end(), extra.begin(), extra.end());
+        run = std::make_unique<daemon_run>(args, inheriting(fds[1]));
+        close(fds[1]);
+    }
+    std::unique_ptr<torvad::peer::connection> ours;
+    std::unique_ptr<daemon_run> run;
+};
+
+} // namespace
+
+TEST(ipc, an_attached_pipe_is_served_until_the_peer_closes_it) {
+    attached pipe({"--", child_binary, "peer"});
+    torvad::peer::packet packet;
+    ASSERT_TRUE(pipe.ours->receive(packet));
+    EXPECT_EQ(packet.header.type, torvad::packet_version);
+    EXPECT_EQ(packet.payload, std::string("\0"
+                                          "1.1.21.0\0Background:false",
+                                          26));
+
+    // The largest packet there is, then a stdin for a channel nobody made.
+    std::string largest(torvad::packet_max_payload, 'x');
+    ASSERT_TRUE(pipe.ours->send(3, 9, 0, largest));
+    ASSERT_TRUE(pipe.ours->send(7, torvad::packet_stdin, 0, "hi"));
+    EXPECT_TRUE(pipe.run->wait_for("<- test_child:3 unknown \n")) << pipe.run->output();
+    EXPECT_TRUE(pipe.run->wait_for("channel 0x7 does not exist"));
+
+    pipe.run->signal(SIGINT);
+    ASSERT_TRUE(pipe.ours->receive(packet));
+    EXPECT_EQ(packet.header.type, torvad::packet_sigterm);
+    pipe.ours.reset();
+    EXPECT_TRUE(pipe.run->wait_for("attached ipc pipe closed."));
+    EXPECT_EQ(pipe.run->wait_exit(), 0) << pipe.run->output();
+    // The command given with -a is never run.
+    EXPECT_EQ(pipe.run->output().find("child: "), std::string::npos) << pipe.run->output();
+}
+
+TEST(ipc, a_failed_attachment_without_a_command_ends_the_run) {
+    daemon_run run({"-a", "4242"});
+    EXPECT_TRUE(run.wait_for("failed to attach to ipc pipe."));
+    EXPECT_TRUE(run.wait_for("executable not specified"));
+    EXPECT_EQ(run.wait_exit(), 0) << run.output();
+}
