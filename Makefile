@@ -20,7 +20,7 @@ build: deps build/build.ninja
 	cmake --build build
 
 run: build
-	./build/torvad -d examples/demo -- ./build/peer_example
+	./build/torvad -d examples/demo -- $(CURDIR)/build/peer_example
 
 test: build
 	ctest --test-dir build --output-on-failure -j2
