@@ -10,6 +10,29 @@
 
 namespace torvad {
 
+namespace {
+
+// Writes the whole front entry of queue, which stays queued until the write
+// is done; then drops it and pumps the next. The handler holds a plain
+// pointer: a write must not keep the object alive, and a closed stream
+// completes it with an error, on which it touches nothing.
+template <class Stream>
+void write_front(Stream& stream, std::deque<std::vector<char>>& queue, process* writer,
+                 void (process::*pump)()) {
+    boost::asio::async_write(
+        stream, boost::asio::buffer(queue.front()),
+        [&queue, writer, pump](const boost::system::error_code& error, std::size_t) {
+            if (error)
+                return;
+            // finish may have emptied the queue meanwhile
+            if (!queue.empty())
+                queue.pop_front();
+            (writer->*pump)();
+        });
+}
+
+} // namespace
+
 void process::read_output(std::int32_t stream) {
     auto& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
     char* buffer = stream == 1 ? stdout_buffer : stderr_buffer;
@@ -54,16 +77,7 @@ void process::pump_stdin() {
             stdin_pipe->close();
         return;
     }
-    // Writes hold a plain pointer: they must not keep the object alive, and a
-    // closed pipe completes them with an error, on which they touch nothing.
-    boost::asio::async_write(*stdin_pipe, boost::asio::buffer(stdin_queue.front()),
-                             [this](const boost::system::error_code& error, std::size_t) {
-                                 if (error)
-                                     return;
-                                 if (!stdin_queue.empty())
-                                     stdin_queue.pop_front();
-                                 pump_stdin();
-                             });
+    write_front(*stdin_pipe, stdin_queue, this, &process::pump_stdin);
 }
 
 void process::send_packet(std::uint32_t channel_id, std::uint32_t type, std::uint32_t flags,
@@ -77,15 +91,7 @@ void process::send_packet(std::uint32_t channel_id, std::uint32_t type, std::uin
 void process::pump_ipc() {
     if (ipc_queue.empty() || !ipc_pipe.is_open())
         return;
-    // Plain pointer, as for stdin: see pump_stdin.
-    boost::asio::async_write(ipc_pipe, boost::asio::buffer(ipc_queue.front()),
-                             [this](const boost::system::error_code& error, std::size_t) {
-                                 if (error)
-                                     return;
-                                 if (!ipc_queue.empty())
-                                     ipc_queue.pop_front();
-                                 pump_ipc();
-                             });
+    write_front(ipc_pipe, ipc_queue, this, &process::pump_ipc);
 }
 
 } // namespace torvad

@@ -93,13 +93,13 @@ namespace {
 // Binds a datagram socket at /dev/log inside a private mount namespace of a
 // forked child, runs torvad there and sends back every record it received.
 std::string syslog_records(const std::vector<std::string>& args) {
+    scratch_dir dev; // ours, so that it goes when the test does
     int report[2];
     if (pipe(report) == -1)
         return "pipe failed";
     pid_t helper = fork();
     if (helper == 0) {
         close(report[0]);
-        scratch_dir dev;
         if (unshare(CLONE_NEWNS) == -1 ||
             mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == -1)
             _exit(2);
