@@ -1,1 +1,99 @@
+// String lists, quoting and packet bytes, against worked examples.
+#include <gtest/gtest.h>
 
+#include "ipc/packet.hpp"
+#include "ipc/strings.hpp"
+
+using namespace torvad;
+
+TEST(codec, split_strings_gives_separators_plus_one_items) {
+    struct row {
+        std::string data;
+        std::vector<std::string> items;
+    };
+    const row rows[] = {
+        {"", {""}},
+        {"abc", {"abc"}},
+        {std::string("a\0b", 3), {"a", "b"}},
+        {std::string("a\0", 2), {"a", ""}},
+        {std::string("\0", 1), {"", ""}},
+        {std::string("\0a", 2), {"", "a"}},
+        {std::string("a\0\0b", 4), {"a", "", "b"}},
+        {"\xff\x80", {"\xff\x80"}},
+    };
+    for (const auto& r : rows) {
+        EXPECT_EQ(split_strings(r.data.data(), r.data.size(), '\0'), r.items);
+        if (!r.data.empty()) {
+            EXPECT_EQ(join_strings(r.items), r.data);
+        }
+    }
+    // Nothing at or behind data + size is read.
+    const char bounded[] = {'a', 'b', '\0', 'c'};
+    EXPECT_EQ(split_strings(bounded, 2, '\0'), std::vector<std::string>{"ab"});
+}
+
+TEST(codec, quote_argument_escapes_only_its_set) {
+    struct row {
+        std::string text;
+        std::string_view set;
+        std::string quoted;
+    };
+    const row rows[] = {
+        {"", command_line_escapes, "\"\""},      {"a\"b", command_line_escapes, "\"a\\\"b\""},
+        {"a\"b", trace_escapes, "\"a\\\"b\""},   {"dir\\", command_line_escapes, "\"dir\\\""},
+        {"dir\\", trace_escapes, "\"dir\\\\\""}, {"\xe9 x", trace_escapes, "\"\xe9 x\""},
+    };
+    for (const auto& r : rows)
+        EXPECT_EQ(quote_argument(r.text, r.set), r.quoted);
+}
+
+TEST(codec, packets_match_their_bytes) {
+    struct row {
+        std::uint32_t channel, type, flags;
+        std::string payload;
+        std::vector<unsigned char> bytes;
+    };
+    const row rows[] = {
+        {0x300002,
+         packet_stdin,
+         stdin_close,
+         "abc",
+         {0x13, 0, 0, 0, 2, 0, 0x30, 0, 0, 0, 0, 0, 1, 0, 0, 0, 'a', 'b', 'c'}},
+        {0x300002,
+         packet_opened,
+         4660,
+         "",
+         {0x10, 0, 0, 0, 2, 0, 0x30, 0, 3, 0, 0, 0, 0x34, 0x12, 0, 0}},
+        {0, packet_sigterm, 0, "", {0x10, 0, 0, 0, 0, 0, 0, 0, 8, 0, 0, 0, 0, 0, 0, 0}},
+        {0x300002,
+         packet_execute,
+         execute_persistent | execute_user,
+         join_strings({"svc", "tool.exe", "-x"}),
+         {0x1f, 0,   0,   0, 2,   0,   0x30, 0,   6,   0,   0,   0,   9, 0,   0,  0,
+          's',  'v', 'c', 0, 't', 'o', 'o',  'l', '.', 'e', 'x', 'e', 0, '-', 'x'}},
+    };
+    for (const auto& r : rows) {
+        auto framed = frame_packet(r.channel, r.type, r.flags, r.payload.data(), r.payload.size());
+        EXPECT_EQ(std::vector<unsigned char>(framed.begin(), framed.end()), r.bytes);
+        packet_header header = read_packet_header(framed.data());
+        EXPECT_EQ(header.length, r.bytes.size());
+        EXPECT_EQ(header.channel, r.channel);
+        EXPECT_EQ(header.type, r.type);
+        EXPECT_EQ(header.flags, r.flags);
+    }
+    for (auto [length, valid] :
+         {std::pair{15u, false}, {16u, true}, {65536u, true}, {65537u, false}})
+        EXPECT_EQ(valid_packet_length(length), valid) << length;
+    EXPECT_STREQ(packet_type_name(packet_sigterm), "sigterm");
+    EXPECT_STREQ(packet_type_name(9), "unknown");
+}
+
+TEST(codec, version_payload_has_three_items_and_no_trailing_nul) {
+    std::string payload = version_payload("torvad.exe", "1.1.21.0", true);
+    EXPECT_EQ(payload, std::string("torvad.exe\0"
+                                   "1.1.21.0\0Background:true",
+                                   35));
+    EXPECT_EQ(version_payload("", "1.1.21.0", false), std::string("\0"
+                                                                  "1.1.21.0\0Background:false",
+                                                                  26));
+}

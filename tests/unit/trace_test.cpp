@@ -1,1 +1,52 @@
+// The text of a trace line: channel labels and packet details.
+#include <gtest/gtest.h>
 
+#include "ipc/packet.hpp"
+#include "ipc/strings.hpp"
+#include "ipc/trace.hpp"
+
+using namespace torvad;
+
+TEST(trace, channel_labels_name_known_modules) {
+    const std::pair<std::uint32_t, std::string> rows[] = {
+        {0, "0"},
+        {5u << 20 | 3, "psfile:3"},
+        {27u << 20 | 1, std::to_string(27u << 20 | 1)},
+        {7, "7"},
+        {87u << 20 | 0xfffff, "axisbw:1048575"},
+        {4095u << 20, "4293918720"},
+    };
+    for (const auto& [channel, label] : rows)
+        EXPECT_EQ(channel_label(channel), label);
+}
+
+TEST(trace, details_by_packet_type) {
+    struct row {
+        std::uint32_t type, flags;
+        std::string payload;
+        std::string name, details;
+    };
+    const row rows[] = {
+        {packet_stdin, 0, "ab\n\x07", "stdin", "ab\\n\\x7"},
+        {packet_stdin, 1, "ab\n\x07", "stdin", "ab\\n\\x7 flags=0x1"},
+        {packet_stdout, 0, "\t\r\xff", "stdout", "\\x9\\r\\xff"},
+        {packet_stderr, 0, std::string(40, 'x'), "stderr", std::string(40, 'x')},
+        {packet_stderr, 0, std::string(41, 'x'), "stderr", std::string(40, 'x') + "..."},
+        {packet_stdout, 0, "", "stdout", ""},
+        {packet_opened, 4660, "", "opened", "pid=4660"},
+        {packet_failed, 13, "", "failed", "status=0xd"},
+        {packet_closed, 0xfffffffe, "", "closed", "status=0xfffffffe"},
+        {packet_sigterm, 7, "", "sigterm", ""},
+        {9, 7, "zz", "unknown", ""},
+        {packet_execute, 9, join_strings({"svc", "a\"b", ""}), "execute",
+         "\"svc\" \"a\\\"b\" \"\" flags=0x9"},
+        {packet_version, 0, version_payload("torvad", "1.1.21.0", false), "version",
+         "\"torvad\" \"1.1.21.0\" \"Background:false\" "},
+    };
+    for (const auto& r : rows) {
+        auto packet = frame_packet(1, r.type, r.flags, r.payload.data(), r.payload.size());
+        trace_text text = describe_packet(packet.data());
+        EXPECT_STREQ(text.type_name, r.name.c_str());
+        EXPECT_EQ(text.details, r.details);
+    }
+}
