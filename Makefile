@@ -43,6 +43,7 @@ fuzz: deps build-fuzz/build.ninja
 	cmake --build build-fuzz --target fuzz_framing
 	mkdir -p build-fuzz/corpus
 	./build-fuzz/fuzz/fuzz_framing -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	  -artifact_prefix=build-fuzz/ \
 	  build-fuzz/corpus fuzz/seeds
 
 bench: build
