@@ -22,10 +22,11 @@ build: deps build/build.ninja
 run: build
 	./build/torvad -d examples/demo -- $(CURDIR)/build/peer_example
 
+# The sanitizer run and the fuzzer first, so the summary of the plain run ends the output.
 test: build
-	ctest --test-dir build --output-on-failure -j2
 	$(MAKE) test-asan
 	$(MAKE) fuzz
+	ctest --test-dir build --output-on-failure -j2
 
 build-asan/build.ninja:
 	cmake -S . -B build-asan -G Ninja -DCMAKE_BUILD_TYPE=Debug -DTORVAD_SANITIZE=ON
