@@ -87,11 +87,13 @@ struct launch_result {
 launch_result launch_child(const launch_request& request);
 
 struct exit_status {
+    bool ended = false;  // false: still running, the readiness was spurious
     bool exited = false; // false: killed by a signal
     int code = 0;        // exit status, or the signal number
 };
 
-// Reaps the child behind pidfd, which must have become readable.
+// Reaps the child behind pidfd without blocking, if it has ended. A child that
+// is already gone counts as ended with 0.
 exit_status reap_child(int pidfd);
 // Ends the child by force.
 void kill_child(int pidfd);

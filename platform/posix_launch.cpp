@@ -214,13 +214,14 @@ exit_status reap_child(int pidfd) {
     siginfo_t info{};
     int reaped;
     do
-        reaped = waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED);
+        reaped = waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info,
+                        WEXITED | WNOHANG);
     while (reaped == -1 && errno == EINTR);
     if (reaped == -1)
-        return {true, 0};
-    if (info.si_code == CLD_EXITED)
-        return {true, info.si_status};
-    return {false, info.si_status};
+        return {true, true, 0};
+    if (info.si_pid == 0)
+        return {false, false, 0};
+    return {true, info.si_code == CLD_EXITED, info.si_status};
 }
 
 void kill_child(int pidfd) {

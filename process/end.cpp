@@ -25,6 +25,11 @@ void process::on_exit(const boost::system::error_code& error) {
     if (error)
         return;
     platform::exit_status exit = platform::reap_child(process_handle.native_handle());
+    if (!exit.ended) {
+        // Readiness is a hint; only the reaped status is the end of a child.
+        watch_exit();
+        return;
+    }
     std::uint32_t code = static_cast<std::uint32_t>(exit.code);
     if (!exit.exited)
         code = forced ? 0 : signal_status_base + code;

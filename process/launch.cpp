@@ -123,10 +123,7 @@ bool process::start() {
 void process::watch_child(int pidfd, int child_pid) {
     process_handle.assign(pidfd);
     pid = static_cast<std::uint32_t>(child_pid);
-    // The exit wait holds a plain pointer: it must not keep the object alive,
-    // and it only completes successfully while the object is in children.
-    process_handle.async_wait(boost::asio::posix::stream_descriptor::wait_read,
-                              [this](const boost::system::error_code& error) { on_exit(error); });
+    watch_exit();
     if (stdio_mode == stdio_pipes) {
         open_streams = 2;
         read_output(1);
@@ -138,6 +135,13 @@ void process::watch_child(int pidfd, int child_pid) {
     }
     if (auto requester = parent.lock())
         requester->send_packet(channel, packet_opened, pid, nullptr, 0);
+}
+
+void process::watch_exit() {
+    // The exit wait holds a plain pointer: it must not keep the object alive,
+    // and it only completes successfully while the object is in children.
+    process_handle.async_wait(boost::asio::posix::stream_descriptor::wait_read,
+                              [this](const boost::system::error_code& error) { on_exit(error); });
 }
 
 } // namespace torvad

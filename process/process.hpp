@@ -112,6 +112,7 @@ class process : public std::enable_shared_from_this<process> {
     bool fail_launch(std::uint32_t status);
     bool make_stdio_pipes();
     void watch_child(int pidfd, int child_pid);
+    void watch_exit();
     void route_stdin(const char* packet);
 };
 

@@ -94,6 +94,26 @@ std::string open_descriptors() {
     return list;
 }
 
+// Has two channels run (one lists its fds, one sleeps), then fails once;
+// started again, it ignores sigterm.
+int mode_spawn_once(const context& how, const char* self) {
+    if (how.args.empty() || access(how.args[0].c_str(), F_OK) == 0)
+        return serve(how, false);
+    close(open(how.args[0].c_str(), O_CREAT | O_WRONLY, 0644));
+    connection link(how.ipc_fd);
+    torvad::peer::version_info version;
+    torvad::peer::read_version(link, version);
+    link.execute(1, 0, {self, "fds"});
+    link.execute(2, 0, {"sleep", "30"});
+    torvad::peer::packet packet;
+    for (int opened = 0; opened < 2 && link.receive(packet);)
+        if (packet.header.type == torvad::packet_opened && packet.header.channel == 2)
+            say("spawned pid=%u", packet.header.flags), ++opened;
+        else if (packet.header.type == torvad::packet_opened)
+            ++opened;
+    return 3;
+}
+
 int mode_fds(const context& how) {
     say("last=%s", how.last.c_str());
     say("fds%s", open_descriptors().c_str());
@@ -207,6 +227,8 @@ int main(int argc, char** argv) {
     int end = how.ipc_fd >= 0 ? argc - 1 : argc;
     for (int i = 2; i < end; ++i)
         how.args.emplace_back(argv[i]);
+    if (argc > 1 && std::strcmp(argv[1], "spawn-once") == 0)
+        return mode_spawn_once(how, argv[0]);
     for (const auto& entry : modes)
         if (argc > 1 && std::strcmp(argv[1], entry.name) == 0)
             return entry.run(how);

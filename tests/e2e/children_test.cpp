@@ -138,3 +138,21 @@ TEST(children, the_account_switch_is_made_before_exec_or_refused) {
         EXPECT_EQ(refused.output().find("child:"), std::string::npos);
     }
 }
+
+// A channel outlives its requester; at the stop it has no living parent, so
+// it is ended by force and that end counts as 0. Channels hold no fd of ours.
+TEST(children, an_orphaned_channel_is_ended_by_force_at_the_stop) {
+    scratch_dir dir;
+    daemon_run run(child({"spawn-once", dir.path + "/spawned"}));
+    ASSERT_FALSE(run.wait_value("spawned pid").empty()) << run.output();
+    EXPECT_TRUE(run.wait_for("starting 'test_child' again."));
+    std::string requester = run.wait_value("ready pid");
+    ASSERT_FALSE(requester.empty()) << run.output();
+    // The requester ignores sigterm, so the run lasts until the orphan's end is seen.
+    run.signal(SIGINT);
+    EXPECT_TRUE(run.wait_for("child: sigterm ignored")) << run.output();
+    EXPECT_TRUE(run.wait_for("'sleep' exited with 0x0.")) << run.output();
+    kill(std::stoi(requester), SIGKILL);
+    EXPECT_EQ(run.wait_exit(), 0) << run.output();
+    EXPECT_NE(run.output().find("child: fds 0 1 2\n"), std::string::npos) << run.output();
+}
