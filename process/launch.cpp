@@ -2,8 +2,6 @@
 // make its pipes, switch account, launch, then watch its exit and streams.
 #include "process/process.hpp"
 
-#include <cerrno>
-
 #include <boost/filesystem/operations.hpp>
 #include <boost/process/search_path.hpp>
 
@@ -46,17 +44,26 @@ bool process::fail_launch(std::uint32_t failure_status) {
     return false;
 }
 
-bool process::make_stdio_pipes() {
+bool process::prepare_stdio(platform::launch_request& request) {
+    if (stdio_mode == stdio_none)
+        request.stdio = platform::stdio_source::null_device;
+    if (stdio_mode != stdio_pipes)
+        return true;
     // async_pipe reports failure by exception; a launch reports it by result.
     try {
         stdin_pipe = std::make_unique<boost::process::async_pipe>(*owner);
         stdout_pipe = std::make_unique<boost::process::async_pipe>(*owner);
         stderr_pipe = std::make_unique<boost::process::async_pipe>(*owner);
-        return true;
     } catch (const boost::system::system_error& error) {
-        errno = error.code().value();
+        owner->log_error("failed to create child process.");
+        fail_launch(error.code().value());
         return false;
     }
+    request.stdio = platform::stdio_source::descriptors;
+    request.stdio_fds[0] = stdin_pipe->native_source();
+    request.stdio_fds[1] = stdout_pipe->native_sink();
+    request.stdio_fds[2] = stderr_pipe->native_sink();
+    return true;
 }
 
 bool process::start() {
@@ -74,19 +81,8 @@ bool process::start() {
         return fail_launch(status_not_found);
     }
     platform::launch_request request;
-    if (stdio_mode == stdio_pipes) {
-        if (!make_stdio_pipes()) {
-            int error = errno;
-            owner->log_error("failed to create child process.");
-            return fail_launch(error);
-        }
-        request.stdio = platform::stdio_source::descriptors;
-        request.stdio_fds[0] = stdin_pipe->native_source();
-        request.stdio_fds[1] = stdout_pipe->native_sink();
-        request.stdio_fds[2] = stderr_pipe->native_sink();
-    } else if (stdio_mode == stdio_none) {
-        request.stdio = platform::stdio_source::null_device;
-    }
+    if (!prepare_stdio(request))
+        return false;
     if (persistent) {
         int error = 0;
         request.ipc_fd = create_ipc_pipe(error);

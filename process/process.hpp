@@ -14,6 +14,8 @@
 #include <boost/asio/posix/stream_descriptor.hpp>
 #include <boost/process/async_pipe.hpp>
 
+#include "platform/platform.hpp"
+
 namespace torvad {
 
 class daemon;
@@ -110,7 +112,7 @@ class process : public std::enable_shared_from_this<process> {
 
     // launch steps (process/launch.cpp)
     bool fail_launch(std::uint32_t status);
-    bool make_stdio_pipes();
+    bool prepare_stdio(platform::launch_request& request);
     void watch_child(int pidfd, int child_pid);
     void watch_exit();
     void route_stdin(const char* packet);
