@@ -33,7 +33,6 @@ void say(const char* format, ...) {
 struct context {
     std::vector<std::string> args; // behind the mode, without the ipc fd
     int ipc_fd = -1;
-    std::string last; // the last argument as given
 };
 
 // Reads version, then reports every packet until sigterm or end of stream.
@@ -80,15 +79,20 @@ int mode_fail_once(const context& how) {
     return serve(how, true);
 }
 
-std::string open_descriptors() {
-    std::string list;
+// "clean" when the open fds are exactly 0, 1, 2 and the ipc end, if any.
+std::string descriptor_report(int ipc_fd) {
+    std::vector<int> fds, expected = {0, 1, 2};
+    if (ipc_fd > 2)
+        expected.push_back(ipc_fd);
     DIR* dir = opendir("/proc/self/fd");
-    std::vector<int> fds;
     while (dirent* entry = readdir(dir))
         if (entry->d_name[0] != '.' && std::atoi(entry->d_name) != dirfd(dir))
             fds.push_back(std::atoi(entry->d_name));
     closedir(dir);
     std::sort(fds.begin(), fds.end());
+    if (fds == expected)
+        return "clean";
+    std::string list = "leaked";
     for (int fd : fds)
         list += " " + std::to_string(fd);
     return list;
@@ -106,17 +110,18 @@ int mode_spawn_once(const context& how, const char* self) {
     link.execute(1, 0, {self, "fds"});
     link.execute(2, 0, {"sleep", "30"});
     torvad::peer::packet packet;
-    for (int opened = 0; opened < 2 && link.receive(packet);)
-        if (packet.header.type == torvad::packet_opened && packet.header.channel == 2)
-            say("spawned pid=%u", packet.header.flags), ++opened;
-        else if (packet.header.type == torvad::packet_opened)
-            ++opened;
+    for (int opened = 0; opened < 2 && link.receive(packet);) {
+        if (packet.header.type != torvad::packet_opened)
+            continue;
+        if (packet.header.channel == 2)
+            say("spawned pid=%u", packet.header.flags);
+        ++opened;
+    }
     return 3;
 }
 
 int mode_fds(const context& how) {
-    say("last=%s", how.last.c_str());
-    say("fds%s", open_descriptors().c_str());
+    say("fds %s", descriptor_report(how.ipc_fd).c_str());
     sigset_t mask;
     sigprocmask(SIG_SETMASK, nullptr, &mask);
     std::string ignored;
@@ -135,8 +140,6 @@ int mode_fds(const context& how) {
     for (int i = 0; i < count; ++i)
         group_list += (i == 0 ? "" : ",") + std::to_string(groups[i]);
     say("uid=%u gid=%u groups=%s", getuid(), getgid(), group_list.c_str());
-    char cwd[4096];
-    say("cwd=%s", getcwd(cwd, sizeof cwd) ? cwd : "?");
     return serve(how, true);
 }
 
@@ -145,11 +148,6 @@ int mode_signal(const context& how) {
     say("raising %d", number);
     std::signal(number, SIG_DFL);
     raise(number);
-    return 0;
-}
-
-int mode_sleep(const context& how) {
-    sleep(how.args.empty() ? 1 : static_cast<unsigned>(std::atoi(how.args[0].c_str())));
     return 0;
 }
 
@@ -212,7 +210,7 @@ const mode modes[] = {
      }},
     {"fds", mode_fds},
     {"signal", mode_signal},
-    {"sleep", mode_sleep},
+
     {"echo", mode_echo},
     {"raw", mode_raw},
     {"close-ipc", mode_close_ipc},
@@ -223,7 +221,6 @@ const mode modes[] = {
 int main(int argc, char** argv) {
     context how;
     how.ipc_fd = torvad::peer::ipc_fd_from_arguments(argc, argv);
-    how.last = argv[argc - 1];
     int end = how.ipc_fd >= 0 ? argc - 1 : argc;
     for (int i = 2; i < end; ++i)
         how.args.emplace_back(argv[i]);

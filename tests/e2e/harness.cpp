@@ -1,5 +1,7 @@
 #include "tests/e2e/harness.hpp"
 
+#include <gtest/gtest.h>
+
 #include <cerrno>
 #include <chrono>
 #include <csignal>
@@ -66,8 +68,6 @@ void open_output(bool terminal, int& ours, int& theirs) {
     if (!how.directory.empty() && chdir(how.directory.c_str()) == -1)
         _exit(126);
     unsetenv("NOTIFY_SOCKET");
-    for (const auto& entry : how.env)
-        putenv(const_cast<char*>(entry.c_str()));
     std::vector<char*> argv{const_cast<char*>(torvad_binary)};
     for (const auto& arg : args)
         argv.push_back(const_cast<char*>(arg.c_str()));
@@ -159,6 +159,33 @@ int daemon_run::wait_exit(int timeout_ms) {
 
 void daemon_run::signal(int signal_number) {
     kill(pid_, signal_number);
+}
+
+void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
+                  const options& how) {
+    daemon_run run(args, how);
+    int child = -1;
+    for (const auto& step : steps) {
+        std::string text = step.substr(1);
+        if (step[0] == '?')
+            EXPECT_TRUE(run.wait_for(text)) << "waited for: " << text << "\n" << run.output();
+        else if (step[0] == '!')
+            run.signal(text == "INT" ? SIGINT : SIGTERM);
+        else if (step[0] == '#')
+            child = std::atoi(run.wait_value(text).c_str());
+        else if (step.rfind("kill ", 0) == 0 && child > 0)
+            kill(child, std::atoi(step.c_str() + 5));
+        else if (step[0] == '=')
+            EXPECT_EQ(run.wait_exit(), std::atoi(text.c_str())) << run.output();
+        else if (step == "Z")
+            EXPECT_EQ(zombie_children(run.pid()), 0);
+        else if (step[0] == '+')
+            EXPECT_NE(run.output().find(text), std::string::npos) << text << "\n" << run.output();
+        else if (step[0] == '-')
+            EXPECT_EQ(run.output().find(text), std::string::npos) << text << "\n" << run.output();
+        else
+            ADD_FAILURE() << "bad step " << step;
+    }
 }
 
 scratch_dir::scratch_dir() {

@@ -64,6 +64,14 @@ class daemon_run {
     std::size_t cursor_ = 0;
 };
 
+// Runs torvad with args through steps, each a check or an action:
+//   "?text" waits for text behind the last match    "!INT" / "!TERM" signals torvad
+//   "#key"  takes the pid behind "key=" as the child "kill N" sends signal N to it
+//   "=N"    expects exit code N                     "-text" text never appears
+//   "+text" text appears anywhere                    "Z" no child of torvad is a zombie
+void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
+                  const options& how = {});
+
 // A scratch directory removed with its contents at the end of the test.
 struct scratch_dir {
     scratch_dir();

@@ -35,51 +35,30 @@ TEST(ipc, packets_split_and_joined_across_reads_are_framed_in_order) {
     const std::string stdin5 = hex_packet(5, torvad::packet_stdin, 0, "abc");
     const std::string stdin6 = hex_packet(6, torvad::packet_stdin, 1, "x");
     const std::string bad = hex_packet(7, torvad::packet_stdin, 0, "", 15);
-    struct row {
-        std::string hex;
-        std::vector<std::string> expected; // in this order
-        std::vector<std::string> absent;
-    };
-    const row rows[] = {
+    const std::pair<std::string, std::vector<std::string>> rows[] = {
         {stdin5 + stdin6,
-         {"<- test_child:5 stdin abc", "channel 0x5 does not exist",
-          "<- test_child:6 stdin x flags=0x1", "channel 0x6 does not exist"},
-         {}},
+         {"?<- test_child:5 stdin abc", "?channel 0x5 does not exist",
+          "?<- test_child:6 stdin x flags=0x1", "?channel 0x6 does not exist"}},
         {stdin5.substr(0, 10) + "/" + stdin5.substr(10, 24) + "/" + stdin5.substr(34),
-         {"channel 0x5 does not exist"},
-         {}},
+         {"?channel 0x5 does not exist"}},
+        // a bad length drops every byte held, whole packets behind it too
         {bad + stdin5 + "/" + stdin6,
-         {"bad ipc packet length", "channel 0x6 does not exist"},
-         {"0x5", "0x7"}},
+         {"?bad ipc packet length", "?channel 0x6 does not exist", "-0x5", "-0x7"}},
         {hex_packet(0x500003, 9, 4, "zz") + hex_packet(1, torvad::packet_sigterm, 0, ""),
-         {"<- test_child:psfile:3 unknown \n", "<- test_child:1 sigterm \n"},
-         {}},
+         {"?<- test_child:psfile:3 unknown \n", "?<- test_child:1 sigterm \n"}},
     };
-    for (const auto& r : rows) {
-        daemon_run run({"-v", "-l", "--", child_binary, "raw", r.hex});
-        for (const auto& line : r.expected)
-            EXPECT_TRUE(run.wait_for(line)) << line << "\n" << run.output();
-        run.signal(SIGINT);
-        EXPECT_EQ(run.wait_exit(), 0) << run.output();
-        for (const auto& text : r.absent)
-            EXPECT_EQ(run.output().find(text), std::string::npos) << text << run.output();
-        EXPECT_NE(run.output().find("-> test_child:0 sigterm \n"), std::string::npos);
+    for (auto [hex, steps] : rows) {
+        steps.insert(steps.end(), {"!INT", "?-> test_child:0 sigterm \n", "=0"});
+        run_scenario({"-v", "-l", "--", child_binary, "raw", hex}, steps);
     }
 }
 
 TEST(ipc, the_trace_is_coloured_at_a_terminal_and_absent_without_v) {
-    daemon_run coloured({"-v", "--", child_binary, "peer"});
-    EXPECT_TRUE(coloured.wait_for("\x1b[36m-> test_child:0\x1b[35m version\x1b[0m \"torvad\" "
-                                  "\"1.1.21.0\" \"Background:false\" \n"))
-        << coloured.output();
-    coloured.signal(SIGINT);
-    EXPECT_EQ(coloured.wait_exit(), 0);
-
-    daemon_run quiet({"--", child_binary, "peer"});
-    EXPECT_TRUE(quiet.wait_for("child: ready"));
-    quiet.signal(SIGINT);
-    EXPECT_EQ(quiet.wait_exit(), 0);
-    EXPECT_EQ(quiet.output().find("version\x1b"), std::string::npos) << quiet.output();
+    run_scenario({"-v", "--", child_binary, "peer"},
+                 {"?\x1b[36m-> test_child:0\x1b[35m version\x1b[0m \"torvad\" \"1.1.21.0\" "
+                  "\"Background:false\" \n",
+                  "!INT", "=0"});
+    run_scenario({"--", child_binary, "peer"}, {"?child: ready", "!INT", "=0", "-version\x1b"});
 }
 
 namespace {
@@ -127,8 +106,6 @@ TEST(ipc, an_attached_pipe_is_served_until_the_peer_closes_it) {
 }
 
 TEST(ipc, a_failed_attachment_without_a_command_ends_the_run) {
-    daemon_run run({"-a", "4242"});
-    EXPECT_TRUE(run.wait_for("failed to attach to ipc pipe."));
-    EXPECT_TRUE(run.wait_for("executable not specified"));
-    EXPECT_EQ(run.wait_exit(), 0) << run.output();
+    run_scenario({"-a", "4242"},
+                 {"?failed to attach to ipc pipe.", "?executable not specified", "=0"});
 }

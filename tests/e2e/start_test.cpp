@@ -35,25 +35,21 @@ TEST(start, help_goes_to_stderr_and_nothing_else_happens) {
 
 // Each row runs at a console with no child: the run starts and ends at once.
 TEST(start, console_run_without_child_handles_bad_options_and_pid_files) {
-    struct row {
-        std::vector<std::string> args;
-        bool pid_error;
-    };
     scratch_dir dir;
-    const row rows[] = {
-        {{}, false},
-        {{"-d"}, false},
-        {{"-a", "garbage", "-d", "/no/such/dir", "stray", "-zz", "-"}, false},
-        {{"-p", dir.path + "/missing/pid"}, true},
-        {{"-p", "relative.pid", "-d", dir.path}, false},
-        {{"-f", "family", "-u", "nobody", "--"}, false},
+    const std::vector<std::string> rows[] = {
+        {},
+        {"-d"},
+        {"-a", "garbage", "-d", "/no/such/dir", "stray", "-zz", "-"},
+        {"-p", dir.path + "/missing/pid"},
+        {"-p", "relative.pid", "-d", dir.path},
+        {"-f", "family", "-u", "nobody", "--"},
     };
-    for (const auto& r : rows) {
-        daemon_run run(r.args, in_directory(dir.path));
-        EXPECT_TRUE(run.wait_for(started)) << run.output();
-        EXPECT_EQ(run.wait_exit(), 0);
-        EXPECT_EQ(run.output().find("failed to create pid file") != std::string::npos, r.pid_error)
-            << run.output();
+    for (const auto& args : rows) {
+        bool pid_error = args.size() == 2 && args[1].ends_with("/missing/pid");
+        run_scenario(args,
+                     {std::string("?") + started, "=0",
+                      pid_error ? "+failed to create pid file" : "-failed to create pid file"},
+                     in_directory(dir.path));
         EXPECT_FALSE(file_exists(dir.path + "/relative.pid"));
     }
 }
@@ -74,18 +70,10 @@ TEST(start, pid_file_holds_the_pid_while_running_and_goes_at_the_end) {
 
 // Outside a service manager the service path ends at once, silently.
 TEST(start, service_path_outside_a_service_manager_starts_nothing) {
-    const std::vector<std::vector<std::string>> rows = {
-        {"--", child_binary, "exit", "0"},
-        {"-v", "-l", "--", child_binary, "exit", "0"},
-    };
-    for (const auto& args : rows) {
-        daemon_run run(args, piped());
-        EXPECT_EQ(run.wait_exit(), 0);
-        EXPECT_EQ(run.output(), "");
-    }
-    daemon_run forced({"-b", "--", child_binary, "exit", "0"});
-    EXPECT_EQ(forced.wait_exit(), 0);
-    EXPECT_EQ(forced.output(), "");
+    const std::vector<std::string> silent = {"=0", "-torvad", "-child"};
+    run_scenario({"--", child_binary, "exit", "0"}, silent, piped());
+    run_scenario({"-v", "-l", "--", child_binary, "exit", "0"}, silent, piped());
+    run_scenario({"-b", "--", child_binary, "exit", "0"}, silent);
 }
 
 namespace {
