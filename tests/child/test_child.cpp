@@ -17,7 +17,8 @@
 
 namespace {
 
-using torvad::peer::connection;
+using namespace torvad;
+using peer::connection;
 
 void say(const char* format, ...) __attribute__((format(printf, 1, 2)));
 void say(const char* format, ...) {
@@ -31,52 +32,54 @@ void say(const char* format, ...) {
 }
 
 struct context {
+    const char* self;
     std::vector<std::string> args; // behind the mode, without the ipc fd
     int ipc_fd = -1;
+    int number(std::size_t i) const { return i < args.size() ? std::atoi(args[i].c_str()) : 0; }
 };
 
+bool create_once(const std::string& path) {
+    if (access(path.c_str(), F_OK) == 0)
+        return false;
+    close(open(path.c_str(), O_CREAT | O_WRONLY, 0644));
+    return true;
+}
+
 // Reads version, then reports every packet until sigterm or end of stream.
-int serve(const context& how, bool obey_sigterm) {
-    if (how.ipc_fd < 0)
-        return 0;
-    connection link(how.ipc_fd);
-    torvad::peer::version_info version;
-    if (!torvad::peer::read_version(link, version)) {
-        say("no version");
+int serve(connection& link, bool obey_sigterm) {
+    peer::version_info version;
+    if (!peer::read_version(link, version))
         return 5;
-    }
     say("version %s %s Background:%s", version.program_name.c_str(), version.version.c_str(),
         version.background ? "true" : "false");
     say("ready pid=%d", getpid());
-    torvad::peer::packet packet;
+    peer::packet packet;
     while (link.receive(packet)) {
-        if (packet.header.type != torvad::packet_sigterm) {
-            say("packet type=%u channel=%u flags=%u size=%zu", packet.header.type,
-                packet.header.channel, packet.header.flags, packet.payload.size());
-            continue;
-        }
-        say(obey_sigterm ? "sigterm" : "sigterm ignored");
-        if (obey_sigterm)
+        if (packet.header.type != packet_sigterm)
+            say("packet type=%u channel=%u", packet.header.type, packet.header.channel);
+        else if (say(obey_sigterm ? "sigterm" : "sigterm ignored"); obey_sigterm)
             return 0;
     }
     say("eof");
     return obey_sigterm ? 4 : 0;
 }
 
+int serve(const context& how, bool obey_sigterm) {
+    if (how.ipc_fd < 0)
+        return 0;
+    connection link(how.ipc_fd);
+    return serve(link, obey_sigterm);
+}
+
 int mode_exit(const context& how) {
-    say("started pid=%d", getpid());
-    return how.args.empty() ? 0 : std::atoi(how.args[0].c_str());
+    return how.number(0);
 }
 
 int mode_fail_once(const context& how) {
-    if (how.args.empty())
-        return 64;
-    if (access(how.args[0].c_str(), F_OK) != 0) {
-        close(open(how.args[0].c_str(), O_CREAT | O_WRONLY, 0644));
-        say("failing");
-        return 3;
-    }
-    return serve(how, true);
+    if (how.args.empty() || !create_once(how.args[0]))
+        return serve(how, true);
+    say("failing");
+    return 3;
 }
 
 // "clean" when the open fds are exactly 0, 1, 2 and the ipc end, if any.
@@ -90,34 +93,10 @@ std::string descriptor_report(int ipc_fd) {
             fds.push_back(std::atoi(entry->d_name));
     closedir(dir);
     std::sort(fds.begin(), fds.end());
-    if (fds == expected)
-        return "clean";
-    std::string list = "leaked";
+    std::string report = fds == expected ? "clean" : "leaked";
     for (int fd : fds)
-        list += " " + std::to_string(fd);
-    return list;
-}
-
-// Has two channels run (one lists its fds, one sleeps), then fails once;
-// started again, it ignores sigterm.
-int mode_spawn_once(const context& how, const char* self) {
-    if (how.args.empty() || access(how.args[0].c_str(), F_OK) == 0)
-        return serve(how, false);
-    close(open(how.args[0].c_str(), O_CREAT | O_WRONLY, 0644));
-    connection link(how.ipc_fd);
-    torvad::peer::version_info version;
-    torvad::peer::read_version(link, version);
-    link.execute(1, 0, {self, "fds"});
-    link.execute(2, 0, {"sleep", "30"});
-    torvad::peer::packet packet;
-    for (int opened = 0; opened < 2 && link.receive(packet);) {
-        if (packet.header.type != torvad::packet_opened)
-            continue;
-        if (packet.header.channel == 2)
-            say("spawned pid=%u", packet.header.flags);
-        ++opened;
-    }
-    return 3;
+        report += " " + std::to_string(fd);
+    return report;
 }
 
 int mode_fds(const context& how) {
@@ -130,10 +109,10 @@ int mode_fds(const context& how) {
         struct sigaction action {};
         blocked = blocked || sigismember(&mask, number) == 1;
         if (sigaction(number, nullptr, &action) == 0 && action.sa_handler == SIG_IGN)
-            ignored += (ignored.empty() ? "" : " ") + std::to_string(number);
+            ignored += " " + std::to_string(number);
     }
     say("sigmask %s", blocked ? "blocked" : "empty");
-    say("ignored %s", ignored.c_str());
+    say("ignored%s.", ignored.c_str());
     gid_t groups[256];
     int count = getgroups(256, groups);
     std::string group_list;
@@ -144,10 +123,8 @@ int mode_fds(const context& how) {
 }
 
 int mode_signal(const context& how) {
-    int number = how.args.empty() ? SIGKILL : std::atoi(how.args[0].c_str());
-    say("raising %d", number);
-    std::signal(number, SIG_DFL);
-    raise(number);
+    std::signal(how.number(0), SIG_DFL);
+    raise(how.number(0));
     return 0;
 }
 
@@ -164,32 +141,76 @@ int mode_echo(const context&) {
 // Writes hex bytes to the pipe; each "/" ends one write and pauses, so the
 // supervisor sees the pieces in separate reads.
 int mode_raw(const context& how) {
-    if (how.args.empty() || how.ipc_fd < 0)
-        return 64;
-    const std::string& hex = how.args[0];
-    std::string bytes;
-    for (std::size_t i = 0; i <= hex.size(); ++i) {
-        if (i == hex.size() || hex[i] == '/') {
-            if (write(how.ipc_fd, bytes.data(), bytes.size()) != static_cast<ssize_t>(bytes.size()))
-                return 6;
+    std::string hex = how.args.empty() ? "" : how.args[0] + "/", bytes;
+    for (std::size_t i = 0; i < hex.size(); ++i) {
+        if (hex[i] != '/') {
+            bytes += static_cast<char>(std::stoi(hex.substr(i++, 2), nullptr, 16));
+        } else if (write(how.ipc_fd, bytes.data(), bytes.size()) == ssize_t(bytes.size())) {
             bytes.clear();
             usleep(50000);
-            continue;
         }
-        bytes += static_cast<char>(std::stoi(hex.substr(i++, 2), nullptr, 16));
     }
     return serve(how, true);
 }
 
 int mode_close_ipc(const context& how) {
-    connection link(how.ipc_fd);
-    torvad::peer::version_info version;
-    torvad::peer::read_version(link, version);
-    link = connection(-1);
+    close(how.ipc_fd);
     say("closed ipc pid=%d", getpid());
-    for (int waited = 0; waited < 30; ++waited)
-        sleep(1);
+    sleep(30);
     return 0;
+}
+
+// Has two channels run (one lists its fds, one sleeps), then fails once;
+// started again, it ignores sigterm.
+int mode_spawn_once(const context& how) {
+    if (how.args.empty() || !create_once(how.args[0]))
+        return serve(how, false);
+    connection link(how.ipc_fd);
+    peer::version_info version;
+    peer::read_version(link, version);
+    link.execute(1, 0, {how.self, "fds"});
+    link.execute(2, 0, {"sleep", "30"});
+    peer::packet packet;
+    for (int opened = 0; opened < 2 && link.receive(packet);)
+        if (packet.header.type == packet_opened && ++opened && packet.header.channel == 2)
+            say("spawned pid=%u", packet.header.flags);
+    return 3;
+}
+
+// Runs "echo" as a channel with relayed streams and checks what comes back:
+// opened first, output in order and in pieces of 4096 at most, closed last.
+int mode_relay(const context& how) {
+    connection link(how.ipc_fd);
+    peer::version_info version;
+    peer::read_version(link, version);
+    std::string sent(10000, 'a'), out, err;
+    for (std::size_t i = 0; i < sent.size(); ++i)
+        sent[i] = static_cast<char>('a' + i % 26);
+    link.execute(7, execute_stdio_pipes, {how.self, "echo"});
+    link.execute(8, execute_stdio_none, {"sleep", "1"});
+    link.send_stdin(7, sent.substr(0, 6000));
+    link.send_stdin(7, sent.substr(6000));
+    link.send_stdin(8, "nobody reads this");
+    peer::packet packet;
+    bool ordered = true, first = true;
+    while (link.receive(packet) &&
+           !(packet.header.channel == 7 && packet.header.type == packet_closed)) {
+        if (packet.header.channel != 7)
+            continue;
+        std::uint32_t type = packet.header.type;
+        ordered = ordered && (first ? type == packet_opened : packet.payload.size() <= 4096);
+        first = false;
+        (type == packet_stderr ? err : out) += packet.payload;
+        if (type == packet_stdout && out.size() == sent.size())
+            link.send_stdin(7, "tail", true);
+    }
+    bool ok = ordered && out == sent + "tail" && err == "child: echo eof\n" &&
+              packet.header.type == packet_closed && packet.header.flags == 0;
+    say("relay %s", ok ? "ok" : "broken");
+    while (link.receive(packet))
+        if (packet.header.type == packet_sigterm)
+            return 0;
+    return 4;
 }
 
 struct mode {
@@ -210,22 +231,19 @@ const mode modes[] = {
      }},
     {"fds", mode_fds},
     {"signal", mode_signal},
-
     {"echo", mode_echo},
     {"raw", mode_raw},
     {"close-ipc", mode_close_ipc},
+    {"spawn-once", mode_spawn_once},
+    {"relay", mode_relay},
 };
 
 } // namespace
 
 int main(int argc, char** argv) {
-    context how;
-    how.ipc_fd = torvad::peer::ipc_fd_from_arguments(argc, argv);
-    int end = how.ipc_fd >= 0 ? argc - 1 : argc;
-    for (int i = 2; i < end; ++i)
+    context how{argv[0], {}, peer::ipc_fd_from_arguments(argc, argv)};
+    for (int i = 2; i < (how.ipc_fd >= 0 ? argc - 1 : argc); ++i)
         how.args.emplace_back(argv[i]);
-    if (argc > 1 && std::strcmp(argv[1], "spawn-once") == 0)
-        return mode_spawn_once(how, argv[0]);
     for (const auto& entry : modes)
         if (argc > 1 && std::strcmp(argv[1], entry.name) == 0)
             return entry.run(how);

@@ -56,7 +56,7 @@ TEST(children, launch_exit_restart_and_stop) {
          {"#closed ipc pid", "!INT", stopping, "kill 15", "?'test_child' exited with 0x8f.", "=0"}},
         // a child holds fds 0, 1, 2 and its ipc end only, with default signals
         {child({"fds"}, {"-v"}),
-         {"?child: fds clean", "?child: sigmask empty", "?child: ignored \n", "!INT", "=0"}},
+         {"?child: fds clean", "?child: sigmask empty", "?child: ignored.\n", "!INT", "=0"}},
         {child({"fds"}, {"-u", "nobody"}),
          {"?child: uid=65534 gid=65534 groups=65534", "!INT", "=0"},
          true},
@@ -73,6 +73,13 @@ TEST(children, launch_exit_restart_and_stop) {
         SCOPED_TRACE(::testing::PrintToString(r.args));
         run_scenario(r.args, r.steps);
     }
+}
+
+// A channel's streams travel over its requester's pipe, stdin only to a
+// channel that has pipes.
+TEST(children, a_channel_relays_its_standard_streams_in_order) {
+    run_scenario(child({"relay"}), {"?channel 0x8 standard input is not available",
+                                    "?child: relay ok", "!INT", "=0"});
 }
 
 // A channel outlives its requester; at the stop it has no living parent, so
