@@ -2,11 +2,9 @@
 
 #include <gtest/gtest.h>
 
-#include <cerrno>
 #include <chrono>
 #include <csignal>
 #include <cstdlib>
-#include <dirent.h>
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
@@ -56,15 +54,10 @@ void open_output(bool terminal, int& ours, int& theirs) {
     dup2(null_fd, 0);
     dup2(out, 1);
     dup2(out, 2);
-    for (int fd = 3; fd < 1024; ++fd) {
-        bool keep = false;
-        for (int kept : how.inherit)
-            keep = keep || kept == fd;
-        if (!keep)
+    for (int fd = 3; fd < 1024; ++fd)
+        if (fd != how.inherit)
             close(fd);
-        else
-            fcntl(fd, F_SETFD, 0);
-    }
+    fcntl(how.inherit, F_SETFD, 0);
     if (!how.directory.empty() && chdir(how.directory.c_str()) == -1)
         _exit(126);
     unsetenv("NOTIFY_SOCKET");
@@ -209,19 +202,12 @@ std::string read_file(const std::string& path) {
 }
 
 int zombie_children(pid_t pid) {
+    std::ifstream children("/proc/" + std::to_string(pid) + "/task/" + std::to_string(pid) +
+                           "/children");
     int zombies = 0;
-    for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
-        std::ifstream status(entry.path() / "status");
-        std::string line, state;
-        pid_t parent = -1;
-        while (std::getline(status, line)) {
-            if (line.rfind("State:", 0) == 0)
-                state = line;
-            if (line.rfind("PPid:", 0) == 0)
-                parent = std::atoi(line.c_str() + 5);
-        }
-        if (parent == pid && state.find('Z') != std::string::npos)
-            ++zombies;
+    for (pid_t child; children >> child;) {
+        std::string stat = read_file("/proc/" + std::to_string(child) + "/stat");
+        zombies += stat.find(") Z ") != std::string::npos;
     }
     return zombies;
 }

@@ -14,28 +14,10 @@ extern const char* const child_binary;
 
 struct options {
     bool terminal = true;         // stdout and stderr on a pty, else a pipe
-    std::vector<int> inherit;     // extra fds the daemon keeps
+    int inherit = -1;             // one more fd the daemon keeps
     std::vector<std::string> env; // NAME=value added to the environment
     std::string directory;        // where it starts; empty: ours
 };
-
-inline options piped() {
-    options how;
-    how.terminal = false;
-    return how;
-}
-
-inline options in_directory(std::string directory) {
-    options how;
-    how.directory = std::move(directory);
-    return how;
-}
-
-inline options inheriting(int fd) {
-    options how;
-    how.inherit = {fd};
-    return how;
-}
 
 class daemon_run {
   public:

@@ -61,48 +61,34 @@ TEST(ipc, the_trace_is_coloured_at_a_terminal_and_absent_without_v) {
     run_scenario({"--", child_binary, "peer"}, {"?child: ready", "!INT", "=0", "-version\x1b"});
 }
 
-namespace {
-
-struct attached {
-    attached(std::vector<std::string> extra) {
-        int fds[2];
-        socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds);
-        ours = std::make_unique<torvad::peer::connection>(fds[0]);
-        std::vector<std::string> args = {"-v", "-l", "-a", "4242", std::to_string(fds[1])};
-        args.insert(args.end(), extra.begin(), extra.end());
-        run = std::make_unique<daemon_run>(args, inheriting(fds[1]));
-        close(fds[1]);
-    }
-    std::unique_ptr<torvad::peer::connection> ours;
-    std::unique_ptr<daemon_run> run;
-};
-
-} // namespace
-
+// The test is the caller that made the socket; the command behind -a is never run.
 TEST(ipc, an_attached_pipe_is_served_until_the_peer_closes_it) {
-    attached pipe({"--", child_binary, "peer"});
+    int fds[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+    torvad::peer::connection ours(fds[0]);
+    daemon_run run({"-v", "-l", "-a", "4242", std::to_string(fds[1]), "--", child_binary, "peer"},
+                   {.inherit = fds[1]});
+    close(fds[1]);
     torvad::peer::packet packet;
-    ASSERT_TRUE(pipe.ours->receive(packet));
+    ASSERT_TRUE(ours.receive(packet));
     EXPECT_EQ(packet.header.type, torvad::packet_version);
     EXPECT_EQ(packet.payload, std::string("\0"
                                           "1.1.21.0\0Background:false",
                                           26));
 
     // The largest packet there is, then a stdin for a channel nobody made.
-    std::string largest(torvad::packet_max_payload, 'x');
-    ASSERT_TRUE(pipe.ours->send(3, 9, 0, largest));
-    ASSERT_TRUE(pipe.ours->send(7, torvad::packet_stdin, 0, "hi"));
-    EXPECT_TRUE(pipe.run->wait_for("<- test_child:3 unknown \n")) << pipe.run->output();
-    EXPECT_TRUE(pipe.run->wait_for("channel 0x7 does not exist"));
+    ASSERT_TRUE(ours.send(3, 9, 0, std::string(torvad::packet_max_payload, 'x')));
+    ASSERT_TRUE(ours.send(7, torvad::packet_stdin, 0, "hi"));
+    EXPECT_TRUE(run.wait_for("<- test_child:3 unknown \n")) << run.output();
+    EXPECT_TRUE(run.wait_for("channel 0x7 does not exist"));
 
-    pipe.run->signal(SIGINT);
-    ASSERT_TRUE(pipe.ours->receive(packet));
+    run.signal(SIGINT);
+    ASSERT_TRUE(ours.receive(packet));
     EXPECT_EQ(packet.header.type, torvad::packet_sigterm);
-    pipe.ours.reset();
-    EXPECT_TRUE(pipe.run->wait_for("attached ipc pipe closed."));
-    EXPECT_EQ(pipe.run->wait_exit(), 0) << pipe.run->output();
-    // The command given with -a is never run.
-    EXPECT_EQ(pipe.run->output().find("child: "), std::string::npos) << pipe.run->output();
+    ours = torvad::peer::connection(-1);
+    EXPECT_TRUE(run.wait_for("attached ipc pipe closed."));
+    EXPECT_EQ(run.wait_exit(), 0) << run.output();
+    EXPECT_EQ(run.output().find("child: "), std::string::npos) << run.output();
 }
 
 TEST(ipc, a_failed_attachment_without_a_command_ends_the_run) {

@@ -24,7 +24,7 @@ const char* const started = "successfully started torvad version 1.1.21.0";
 TEST(start, help_goes_to_stderr_and_nothing_else_happens) {
     scratch_dir dir;
     std::string pid_file = dir.path + "/pid";
-    daemon_run run({"-p", pid_file, "-v", "-h", "-p"}, piped());
+    daemon_run run({"-p", pid_file, "-v", "-h", "-p"}, {.terminal = false});
     EXPECT_EQ(run.wait_exit(), 0);
     std::string usage = std::string("torvad version 1.1.21.0\nUsage: ") + torvad_binary +
                         " <options> -- <exe> <exe args>\n  -h  help\n";
@@ -49,7 +49,7 @@ TEST(start, console_run_without_child_handles_bad_options_and_pid_files) {
         run_scenario(args,
                      {std::string("?") + started, "=0",
                       pid_error ? "+failed to create pid file" : "-failed to create pid file"},
-                     in_directory(dir.path));
+                     {.directory = dir.path});
         EXPECT_FALSE(file_exists(dir.path + "/relative.pid"));
     }
 }
@@ -59,7 +59,7 @@ TEST(start, console_run_without_child_handles_bad_options_and_pid_files) {
 TEST(start, pid_file_holds_the_pid_while_running_and_goes_at_the_end) {
     scratch_dir dir, elsewhere;
     daemon_run run({"-p", "torvad.pid", "-d", elsewhere.path, "--", child_binary, "peer"},
-                   in_directory(dir.path));
+                   {.directory = dir.path});
     ASSERT_TRUE(run.wait_for("child: ready")) << run.output();
     EXPECT_EQ(read_file(dir.path + "/torvad.pid"), std::to_string(run.pid()) + "\n");
     run.signal(SIGTERM);
@@ -71,8 +71,8 @@ TEST(start, pid_file_holds_the_pid_while_running_and_goes_at_the_end) {
 // Outside a service manager the service path ends at once, silently.
 TEST(start, service_path_outside_a_service_manager_starts_nothing) {
     const std::vector<std::string> silent = {"=0", "-torvad", "-child"};
-    run_scenario({"--", child_binary, "exit", "0"}, silent, piped());
-    run_scenario({"-v", "-l", "--", child_binary, "exit", "0"}, silent, piped());
+    run_scenario({"--", child_binary, "exit", "0"}, silent, {.terminal = false});
+    run_scenario({"-v", "-l", "--", child_binary, "exit", "0"}, silent, {.terminal = false});
     run_scenario({"-b", "--", child_binary, "exit", "0"}, silent);
 }
 

@@ -50,33 +50,28 @@ TEST(codec, quote_argument_escapes_only_its_set) {
 TEST(codec, packets_match_their_bytes) {
     struct row {
         std::uint32_t channel, type, flags;
-        std::string payload;
-        std::vector<unsigned char> bytes;
+        std::string payload, hex;
     };
     const row rows[] = {
-        {0x300002,
-         packet_stdin,
-         stdin_close,
-         "abc",
-         {0x13, 0, 0, 0, 2, 0, 0x30, 0, 0, 0, 0, 0, 1, 0, 0, 0, 'a', 'b', 'c'}},
-        {0x300002,
-         packet_opened,
-         4660,
-         "",
-         {0x10, 0, 0, 0, 2, 0, 0x30, 0, 3, 0, 0, 0, 0x34, 0x12, 0, 0}},
-        {0, packet_sigterm, 0, "", {0x10, 0, 0, 0, 0, 0, 0, 0, 8, 0, 0, 0, 0, 0, 0, 0}},
-        {0x300002,
-         packet_execute,
-         execute_persistent | execute_user,
+        {0x300002, packet_stdin, stdin_close, "abc", "13000000 02003000 00000000 01000000 616263"},
+        {0x300002, packet_opened, 4660, "", "10000000 02003000 03000000 34120000"},
+        {0, packet_sigterm, 0, "", "10000000 00000000 08000000 00000000"},
+        {0x300002, packet_execute, execute_persistent | execute_user,
          join_strings({"svc", "tool.exe", "-x"}),
-         {0x1f, 0,   0,   0, 2,   0,   0x30, 0,   6,   0,   0,   0,   9, 0,   0,  0,
-          's',  'v', 'c', 0, 't', 'o', 'o',  'l', '.', 'e', 'x', 'e', 0, '-', 'x'}},
+         "1f000000 02003000 06000000 09000000 73766300 746f6f6c2e65786500 2d78"},
     };
     for (const auto& r : rows) {
         auto framed = frame_packet(r.channel, r.type, r.flags, r.payload.data(), r.payload.size());
-        EXPECT_EQ(std::vector<unsigned char>(framed.begin(), framed.end()), r.bytes);
+        std::string hex, expected = r.hex;
+        std::erase(expected, ' ');
+        char digits[3];
+        for (char byte : framed) {
+            std::snprintf(digits, sizeof digits, "%02x", static_cast<unsigned char>(byte));
+            hex += digits;
+        }
+        EXPECT_EQ(hex, expected);
         packet_header header = read_packet_header(framed.data());
-        EXPECT_EQ(header.length, r.bytes.size());
+        EXPECT_EQ(header.length, framed.size());
         EXPECT_EQ(header.channel, r.channel);
         EXPECT_EQ(header.type, r.type);
         EXPECT_EQ(header.flags, r.flags);

@@ -3,83 +3,43 @@
 
 #include "entry/command_line.hpp"
 
-using torvad::command_line;
-
 namespace {
 
-command_line scan(std::vector<std::string> args) {
+// The scanned values in one line, so that each case is one row.
+std::string scanned(std::vector<std::string> args) {
     args.insert(args.begin(), "torvad");
     std::vector<char*> argv;
     for (auto& arg : args)
         argv.push_back(arg.data());
-    return torvad::scan_command_line(static_cast<int>(argv.size()), argv.data());
+    auto c = torvad::scan_command_line(static_cast<int>(argv.size()), argv.data());
+    std::string text = std::string(c.help ? "h" : "") + (c.verbose ? "v" : "") +
+                       (c.logging ? "l" : "") + (c.background ? "b" : "") +
+                       (c.no_restart ? "o" : "") + " f=" + c.family + " u=" + c.user +
+                       " d=" + c.directory + " p=" + (c.pid_file ? c.pid_file : "null") +
+                       " a=" + std::to_string(c.attach_pid) + "," + std::to_string(c.attach_pipe);
+    for (const auto& word : c.command)
+        text += " [" + word + "]";
+    return text;
 }
 
 } // namespace
 
 TEST(command_line, options_values_and_the_end_of_the_scan) {
-    struct row {
-        std::vector<std::string> args;
-        void (*check)(const command_line&);
-    };
-    const row rows[] = {
-        {{"-verbose", "-vl"},
-         [](const command_line& c) {
-             EXPECT_TRUE(c.verbose && !c.logging);
-         }},
-        {{"-p", "-v"},
-         [](const command_line& c) {
-             EXPECT_STREQ(c.pid_file, "-v");
-             EXPECT_FALSE(c.verbose);
-         }},
-        {{"-pfile", "other"},
-         [](const command_line& c) {
-             EXPECT_STREQ(c.pid_file, "other");
-         }},
-        {{"-d", "a", "stray", "-d", "b", "-z", "-", "-d"},
-         [](const command_line& c) {
-             EXPECT_EQ(c.directory, "b");
-         }},
-        {{"-a", "12x", "7"},
-         [](const command_line& c) {
-             EXPECT_EQ(c.attach_pid, 12);
-             EXPECT_EQ(c.attach_pipe, 7);
-         }},
-        {{"-a", "1234"},
-         [](const command_line& c) {
-             EXPECT_EQ(c.attach_pid, 1234);
-             EXPECT_EQ(c.attach_pipe, -1);
-         }},
-        {{"-a", "abc", "-1"},
-         [](const command_line& c) {
-             EXPECT_EQ(c.attach_pid, 0);
-             EXPECT_EQ(c.attach_pipe, -1);
-         }},
+    const std::string plain = " f=torvaSentry u= d= p=null a=0,-1";
+    const std::pair<std::vector<std::string>, std::string> rows[] = {
+        {{}, plain},
+        {{"-verbose", "-vl"}, "v" + plain},
+        {{"-p", "-v"}, " f=torvaSentry u= d= p=-v a=0,-1"},
+        {{"-pfile", "other"}, " f=torvaSentry u= d= p=other a=0,-1"},
+        {{"-d", "a", "stray", "-d", "b", "-z", "-", "-d"}, " f=torvaSentry u= d=b p=null a=0,-1"},
+        {{"-a", "12x", "7"}, " f=torvaSentry u= d= p=null a=12,7"},
+        {{"-a", "1234"}, " f=torvaSentry u= d= p=null a=1234,-1"},
+        {{"-a", "abc", "-1"}, plain},
         {{"-o", "-b", "-f", "fam", "-u", "svc", "--", "prog", "-v", "--"},
-         [](const command_line& c) {
-             EXPECT_TRUE(c.no_restart && c.background && !c.verbose);
-             EXPECT_EQ(c.family, "fam");
-             EXPECT_EQ(c.user, "svc");
-             EXPECT_EQ(c.command, (std::vector<std::string>{"prog", "-v", "--"}));
-         }},
-        {{"-v", "--"},
-         [](const command_line& c) {
-             EXPECT_TRUE(c.command.empty());
-         }},
-        {{"-l", "-help", "-v", "-p", "x"},
-         [](const command_line& c) {
-             EXPECT_TRUE(c.help && c.logging && !c.verbose);
-             EXPECT_EQ(c.pid_file, nullptr);
-         }},
-        {{},
-         [](const command_line& c) {
-             EXPECT_EQ(c.family, "torvaSentry");
-             EXPECT_EQ(c.attach_pid, 0);
-             EXPECT_EQ(c.attach_pipe, -1);
-         }},
+         "bo f=fam u=svc d= p=null a=0,-1 [prog] [-v] [--]"},
+        {{"-v", "--"}, "v" + plain},
+        {{"-l", "-help", "-v", "-p", "x"}, "hl" + plain},
     };
-    for (const auto& r : rows) {
-        SCOPED_TRACE(::testing::PrintToString(r.args));
-        r.check(scan(r.args));
-    }
+    for (const auto& [args, expected] : rows)
+        EXPECT_EQ(scanned(args), expected) << ::testing::PrintToString(args);
 }
