@@ -26,7 +26,9 @@ void process::on_exit(const boost::system::error_code& error) {
         return;
     platform::exit_status exit = platform::reap_child(process_handle.native_handle());
     if (!exit.ended) {
-        // Readiness is a hint; only the reaped status is the end of a child.
+        // Readiness is a hint: the loop can hand the stale readiness of a
+        // descriptor closed in this turn to one opened after it. Only a reaped
+        // status is the end of a child.
         watch_exit();
         return;
     }
