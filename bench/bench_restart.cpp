@@ -3,7 +3,7 @@
 // pidfd and forks and executes the same child at once.
 //   bench_restart [path of torvad]
 #include <algorithm>
-#include <cerrno>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -22,6 +22,7 @@ namespace {
 
 constexpr int restarts = 1000;
 constexpr std::size_t record_size = 32; // "s|e <20 digits>\n", padded
+constexpr int run_limit_s = 60;         // a hung torvad fails the run instead
 
 long long now_ns() {
     timespec now{};
@@ -48,53 +49,80 @@ int run_child(const char* log_path) {
     return enough ? 0 : 1;
 }
 
-double median_latency_us(const char* log_path) {
+// The gaps from each exit to the next start in one log, in microseconds.
+std::vector<double> restart_gaps_us(const char* log_path) {
     std::FILE* log = std::fopen(log_path, "r");
-    std::vector<long long> gaps;
+    std::vector<double> gaps;
     char kind;
     long long stamp, last_exit = -1;
     while (log && std::fscanf(log, " %c %lld", &kind, &stamp) == 2) {
         if (kind == 'e')
             last_exit = stamp;
         else if (last_exit >= 0)
-            gaps.push_back(stamp - last_exit);
+            gaps.push_back((stamp - last_exit) / 1000.0);
     }
     if (log)
         std::fclose(log);
-    if (gaps.empty())
-        return 0;
-    std::nth_element(gaps.begin(), gaps.begin() + gaps.size() / 2, gaps.end());
-    return gaps[gaps.size() / 2] / 1000.0;
+    return gaps;
 }
 
-void drain(int fd) {
+double median(std::vector<double> values) {
+    if (values.empty())
+        return 0;
+    std::nth_element(values.begin(), values.begin() + values.size() / 2, values.end());
+    return values[values.size() / 2];
+}
+
+// Reads torvad's console until it ends (EIO once it and its children are
+// gone). A run past the deadline is a hang: torvad is killed and false returned.
+bool drain_until_end(int terminal, pid_t torvad_pid) {
+    const long long deadline = now_ns() + run_limit_s * 1000000000LL;
     char buffer[4096];
-    while (read(fd, buffer, sizeof buffer) > 0) {
+    while (now_ns() < deadline) {
+        pollfd output{terminal, POLLIN, 0};
+        if (poll(&output, 1, 100) == 1 && read(terminal, buffer, sizeof buffer) <= 0)
+            return true;
     }
+    kill(torvad_pid, SIGKILL);
+    return false;
 }
 
 // torvad at a pseudo-terminal, so that it runs in the foreground.
-void run_supervised(const char* torvad, const std::string& self, const char* log_path) {
+bool run_supervised(const char* torvad, const std::string& self, const char* log_path) {
     int terminal = -1;
     pid_t pid = forkpty(&terminal, nullptr, nullptr, nullptr);
+    if (pid == -1)
+        return false;
     if (pid == 0) {
         execl(torvad, torvad, "--", self.c_str(), "child", log_path, nullptr);
         _exit(127);
     }
-    drain(terminal); // ends with EIO once torvad and its children are gone
-    waitpid(pid, nullptr, 0);
+    bool ended = drain_until_end(terminal, pid);
+    int status = 0;
+    waitpid(pid, &status, 0);
     close(terminal);
+    if (!ended)
+        std::fprintf(stderr, "torvad did not end within %d s\n", run_limit_s);
+    else if (!WIFEXITED(status) || WEXITSTATUS(status) != 0)
+        std::fprintf(stderr, "torvad ended with status 0x%x\n", status);
+    return ended && WIFEXITED(status) && WEXITSTATUS(status) == 0;
 }
 
 // The least a supervisor does: wait on a pidfd, reap, fork and exec again.
 void run_bare(const std::string& self, const char* log_path) {
     for (int started = 0; started <= restarts; ++started) {
         pid_t pid = fork();
+        if (pid == -1)
+            return;
         if (pid == 0) {
             execl(self.c_str(), self.c_str(), "child", log_path, nullptr);
             _exit(127);
         }
         int pidfd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+        if (pidfd == -1) {
+            waitpid(pid, nullptr, 0);
+            return;
+        }
         pollfd exited{pidfd, POLLIN, 0};
         poll(&exited, 1, -1);
         siginfo_t info{};
@@ -105,6 +133,16 @@ void run_bare(const std::string& self, const char* log_path) {
     }
 }
 
+// A log file of its own for one side of the run, or an empty name.
+std::string temporary_log(const char* side) {
+    std::string path = std::string("/tmp/bench-restart-") + side + "-XXXXXX";
+    int fd = mkstemp(path.data());
+    if (fd == -1)
+        return {};
+    close(fd);
+    return path;
+}
+
 } // namespace
 
 int main(int argc, char** argv) {
@@ -113,19 +151,24 @@ int main(int argc, char** argv) {
     const char* torvad = argc > 1 ? argv[1] : "./build/torvad";
     char self[4096];
     ssize_t length = readlink("/proc/self/exe", self, sizeof self - 1);
-    if (length <= 0)
+    if (length <= 0 || access(torvad, X_OK) != 0) {
+        std::fprintf(stderr, "usage: %s [path of torvad]\n", argv[0]);
         return 1;
+    }
     self[length] = '\0';
-    char supervised_log[] = "/tmp/bench-restart-torvad-XXXXXX";
-    char bare_log[] = "/tmp/bench-restart-bare-XXXXXX";
-    close(mkstemp(supervised_log));
-    close(mkstemp(bare_log));
-    run_supervised(torvad, self, supervised_log);
-    run_bare(self, bare_log);
-    double supervised = median_latency_us(supervised_log), bare = median_latency_us(bare_log);
+    std::string supervised_log = temporary_log("torvad"), bare_log = temporary_log("bare");
+    bool supervised_ok = run_supervised(torvad, self, supervised_log.c_str());
+    run_bare(self, bare_log.c_str());
+    auto supervised = restart_gaps_us(supervised_log.c_str());
+    auto bare = restart_gaps_us(bare_log.c_str());
+    unlink(supervised_log.c_str());
+    unlink(bare_log.c_str());
+    if (!supervised_ok || supervised.size() != restarts || bare.size() != restarts) {
+        std::fprintf(stderr, "incomplete run: %zu restarts under torvad, %zu in the bare loop\n",
+                     supervised.size(), bare.size());
+        return 1;
+    }
     std::printf("restart latency median over %d: torvad %.0f us, bare loop %.0f us, ratio %.2f\n",
-                restarts, supervised, bare, bare > 0 ? supervised / bare : 0.0);
-    unlink(supervised_log);
-    unlink(bare_log);
-    return supervised > 0 && bare > 0 ? 0 : 1;
+                restarts, median(supervised), median(bare), median(supervised) / median(bare));
+    return 0;
 }

@@ -1,4 +1,4 @@
-// String lists, quoting and packet bytes, against worked examples.
+// String lists, quoting and packet bytes, against known byte sequences.
 #include <gtest/gtest.h>
 
 #include "ipc/packet.hpp"
@@ -27,9 +27,11 @@ TEST(codec, split_strings_gives_separators_plus_one_items) {
             EXPECT_EQ(join_strings(r.items), r.data);
         }
     }
-    // Nothing at or behind data + size is read.
+    // Nothing at or behind data + size is read: the NUL there would add an item.
     const char bounded[] = {'a', 'b', '\0', 'c'};
     EXPECT_EQ(split_strings(bounded, 2, '\0'), std::vector<std::string>{"ab"});
+    EXPECT_EQ(split_strings(bounded, 3, '\0'), (std::vector<std::string>{"ab", ""}));
+    EXPECT_EQ(split_strings(bounded + 2, 0, '\0'), std::vector<std::string>{""});
 }
 
 TEST(codec, quote_argument_escapes_only_its_set) {
@@ -55,6 +57,7 @@ TEST(codec, packets_match_their_bytes) {
     const row rows[] = {
         {0x300002, packet_stdin, stdin_close, "abc", "13000000 02003000 00000000 01000000 616263"},
         {0x300002, packet_opened, 4660, "", "10000000 02003000 03000000 34120000"},
+        {0x300002, packet_failed, 13, "", "10000000 02003000 04000000 0d000000"},
         {0, packet_sigterm, 0, "", "10000000 00000000 08000000 00000000"},
         {0x300002, packet_execute, execute_persistent | execute_user,
          join_strings({"svc", "tool.exe", "-x"}),

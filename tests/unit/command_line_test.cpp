@@ -34,12 +34,28 @@ TEST(command_line, options_values_and_the_end_of_the_scan) {
         {{"-d", "a", "stray", "-d", "b", "-z", "-", "-d"}, " f=torvaSentry u= d=b p=null a=0,-1"},
         {{"-a", "12x", "7"}, " f=torvaSentry u= d= p=null a=12,7"},
         {{"-a", "1234"}, " f=torvaSentry u= d= p=null a=1234,-1"},
-        {{"-a", "abc", "-1"}, plain},
+        {{"-a", "9", "x", "-a", "abc"}, " f=torvaSentry u= d= p=null a=0,0"},
         {{"-o", "-b", "-f", "fam", "-u", "svc", "--", "prog", "-v", "--"},
          "bo f=fam u=svc d= p=null a=0,-1 [prog] [-v] [--]"},
         {{"-v", "--"}, "v" + plain},
         {{"-l", "-help", "-v", "-p", "x"}, "hl" + plain},
+        {{"-h", "--", "prog"}, "h" + plain},
     };
     for (const auto& [args, expected] : rows)
         EXPECT_EQ(scanned(args), expected) << ::testing::PrintToString(args);
+}
+
+TEST(command_line, help_names_the_program_and_every_option) {
+    EXPECT_EQ(torvad::help_text("prog"), "torvad version 1.1.21.0\n"
+                                         "Usage: prog <options> -- <exe> <exe args>\n"
+                                         "  -h  help\n"
+                                         "  -v  verbose\n"
+                                         "  -l  enable logging\n"
+                                         "  -b  start service\n"
+                                         "  -o  disable auto restart after failure\n"
+                                         "  -f  <product family>\n"
+                                         "  -u  <user>\n"
+                                         "  -d  <directory>\n"
+                                         "  -p  <pid file>\n"
+                                         "  -a  <pid> <pipe>\n");
 }
