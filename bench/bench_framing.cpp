@@ -7,13 +7,11 @@
 #include <cstring>
 #include <map>
 #include <string>
-#include <sys/socket.h>
 #include <unistd.h>
 #include <vector>
 
-#include "daemon/daemon.hpp"
+#include "ipc/framer.hpp"
 #include "ipc/packet.hpp"
-#include "process/process.hpp"
 
 using namespace torvad;
 
@@ -29,38 +27,28 @@ std::vector<char> full_read() {
     const std::string payload(packet_size - packet_header_size, 'p');
     std::vector<char> bytes;
     for (std::uint32_t i = 0; i < packets_per_read; ++i) {
-        auto packet = frame_packet(i, ignored_type, 0, payload.data(), payload.size());
+        auto packet = encode_packet(i, ignored_type, 0, payload.data(), payload.size());
         bytes.insert(bytes.end(), packet.begin(), packet.end());
     }
     return bytes;
-}
-
-// An attached peer, as torvad -a makes one; its read is armed but never run.
-process& attached_object() {
-    static process* object = [] {
-        int fds[2];
-        if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) == -1)
-            std::abort();
-        auto created = process::create(&the_daemon, {"bench"}, "", ".", {}, true, stdio_inherit);
-        created->attach(1, fds[0]);
-        return created.get();
-    }();
-    return *object;
 }
 
 // A read that ends on a packet boundary leaves the buffer as it was, so the
 // bytes go in once and every iteration frames the whole of them again.
 void framing(benchmark::State& state) {
     auto bytes = full_read();
-    process& object = attached_object();
-    std::memcpy(object.ipc_buffer, bytes.data(), bytes.size());
+    framer input;
+    std::memcpy(input.free_space(), bytes.data(), bytes.size());
+    std::uint32_t framed = 0;
+    bool bad = false;
     for (auto _ : state) {
-        object.ipc_fill = 0;
-        object.frame_ipc(static_cast<std::uint32_t>(bytes.size()));
-        benchmark::DoNotOptimize(object.ipc_fill);
+        input.add(
+            bytes.size(), [&](const packet_header& header, const char*) { framed += header.type; },
+            [&] { bad = true; });
+        benchmark::DoNotOptimize(framed);
         benchmark::ClobberMemory();
     }
-    if (object.ipc_fill != 0)
+    if (bad || input.held() != 0)
         state.SkipWithError("a whole packet was left unframed");
     state.SetItemsProcessed(state.iterations() * packets_per_read);
 }

@@ -1,8 +1,10 @@
+// The daemon's life: configuration, the start of its children, the signal
+// that stops them, and the end of the run when no persistent child is left.
 #include "daemon/daemon.hpp"
 
 #include <csignal>
+#include <exception>
 
-#include "ipc/patterns.hpp"
 #include "process/process.hpp"
 
 namespace torvad {
@@ -13,32 +15,48 @@ bool background = false;
 bool auto_restart = true;
 const char* const daemon_version = "1.1.21.0";
 
-daemon::daemon() : colour(platform::stdout_is_terminal()), signals(*this, SIGINT) {}
+daemon::daemon() : colour_(platform::stdout_is_terminal()), signals_(*this, SIGINT) {}
 
 daemon::~daemon() {
     // Children go first, while the loop's services still exist for the
     // descriptors they close; the base then drops whatever handlers remain.
-    children.clear();
+    children_.clear();
 }
 
 void daemon::configure(const std::string& name, const char* patterns_path) {
-    service_name = name;
-    if (patterns_path == nullptr)
-        allow_all = true;
-    else
-        load_patterns(*this, patterns_path);
+    service_name_ = name;
+    if (patterns_path != nullptr)
+        load_patterns(patterns_path);
     arm_signal_wait();
 }
 
+void daemon::load_patterns(const char* path) {
+    std::string text;
+    platform::os_error error = platform::read_file(path, text);
+    std::vector<std::string> problems;
+    patterns_ = parse_patterns(text, path, problems);
+    // An unreadable file leaves the lists empty: closed, not open.
+    if (error) {
+        log_error("failed to open patterns file '%s'", path);
+        log_verbose("%s", platform::describe(error).c_str());
+    }
+    for (const auto& problem : problems)
+        log_error("%s", problem.c_str());
+}
+
+void daemon::add_stop_signal(int signal_number) {
+    signals_.add(signal_number);
+}
+
 void daemon::arm_signal_wait() {
-    signals.async_wait([this](const boost::system::error_code& error, int signal_number) {
+    signals_.async_wait([this](const boost::system::error_code& error, int signal_number) {
         on_signal(error, signal_number);
     });
 }
 
 void daemon::start() {
     // Starting a child that fails takes it out of the live set, so walk a copy.
-    auto starting = children;
+    auto starting = children_;
     bool all_started = true;
     for (const auto& child : starting)
         all_started = child->start() && all_started;
@@ -54,7 +72,7 @@ void daemon::terminate_children() {
     log_info("stopping torvad version %s...", daemon_version);
     // terminate never changes the set (an exit is seen later, on the loop),
     // but a copy keeps that a local fact rather than a promise of process.
-    auto stopping = children;
+    auto stopping = children_;
     for (const auto& child : stopping)
         if (child->parent.expired() || child->persistent)
             child->terminate();
@@ -75,29 +93,42 @@ void daemon::on_signal(const boost::system::error_code& error, int /*signal_numb
 }
 
 bool daemon::any_persistent() const {
-    for (const auto& child : children)
+    for (const auto& child : children_)
         if (child->persistent)
             return true;
     return false;
 }
 
 void daemon::run() {
-    if (!any_persistent())
-        return;
-    boost::system::error_code error;
-    io_context::run(error);
-    if (error)
-        throw boost::system::system_error(error);
+    // Handlers report failures by result, not by exception; what can still
+    // come out of one is an allocation that failed. The loop logs it and goes
+    // on, so that one child's bad moment doesn't end the others' supervision.
+    while (any_persistent()) {
+        try {
+            io_context::run();
+            return;
+        } catch (const std::exception& failure) {
+            log_error("internal error: %s", failure.what());
+        }
+    }
 }
 
-void daemon::remove(std::shared_ptr<process> child) {
-    for (const auto& member : children)
+void daemon::adopt(std::shared_ptr<process> child) {
+    children_.insert(std::move(child));
+}
+
+void daemon::remove(const std::shared_ptr<process>& child) {
+    for (const auto& member : children_)
         if (member->parent.lock() == child)
             member->close_pipes();
-    children.erase(child);
+    children_.erase(child);
     if (!any_persistent())
         io_context::stop();
 }
+
+// The start state is made before the daemon's own descriptors exist, so that
+// none of them can take the number of a standard stream a parent left closed.
+static const bool own_process_prepared = (platform::prepare_own_process(), true);
 
 daemon the_daemon;
 

@@ -1,17 +1,23 @@
 // Console lines and event log records: the only voice of the supervisor.
 #include "daemon/daemon.hpp"
 
+#include <cstdarg>
 #include <cstdio>
 
 namespace torvad {
 
 namespace {
 constexpr std::size_t log_buffer_size = 4096;
-}
+// Colour numbers of the console line: the second digit of an ANSI foreground.
+enum level_colour : int { colour_red = 1, colour_green = 2, colour_yellow = 3 };
+} // namespace
 
-void daemon::log_line(event_type type, int colour_number, const char* text) {
+void daemon::log_line(event_type type, int colour_number, const char* format, va_list args) {
+    // A longer text is cut to 4095 characters without a word about it.
+    char text[log_buffer_size];
+    std::vsnprintf(text, sizeof text, format, args);
     std::tm now = platform::local_time_now();
-    if (colour)
+    if (colour_)
         std::printf("\x1b[3%dm%02d:%02d:%02d\x1b[36m torvad\x1b[0m %s\n", colour_number,
                     now.tm_hour, now.tm_min, now.tm_sec, text);
     else
@@ -20,32 +26,33 @@ void daemon::log_line(event_type type, int colour_number, const char* text) {
         platform::write_event_record(type, text);
 }
 
-void daemon::log_format(event_type type, int colour_number, const char* format, va_list args) {
-    // A longer text is cut to 4095 characters without a word about it.
-    char buffer[log_buffer_size];
-    std::vsnprintf(buffer, sizeof buffer, format, args);
-    log_line(type, colour_number, buffer);
+void daemon::log_error(const char* format, ...) {
+    va_list args;
+    va_start(args, format);
+    log_line(event_type::error, colour_red, format, args);
+    va_end(args);
 }
 
-#define TORVAD_LOG_FRONT_END(name, type, colour_number)                                            \
-    void daemon::name(const char* format, ...) {                                                   \
-        va_list args;                                                                              \
-        va_start(args, format);                                                                    \
-        log_format(type, colour_number, format, args);                                             \
-        va_end(args);                                                                              \
-    }
+void daemon::log_warning(const char* format, ...) {
+    va_list args;
+    va_start(args, format);
+    log_line(event_type::warning, colour_yellow, format, args);
+    va_end(args);
+}
 
-TORVAD_LOG_FRONT_END(log_error, event_type::error, colour_red)
-TORVAD_LOG_FRONT_END(log_warning, event_type::warning, colour_yellow)
-TORVAD_LOG_FRONT_END(log_info, event_type::information, colour_green)
-#undef TORVAD_LOG_FRONT_END
+void daemon::log_info(const char* format, ...) {
+    va_list args;
+    va_start(args, format);
+    log_line(event_type::information, colour_green, format, args);
+    va_end(args);
+}
 
 void daemon::log_verbose(const char* format, ...) {
     if (!verbose)
         return;
     va_list args;
     va_start(args, format);
-    log_format(event_type::information, colour_green, format, args);
+    log_line(event_type::information, colour_green, format, args);
     va_end(args);
 }
 

@@ -2,7 +2,7 @@
 #include <csignal>
 #include <cstdio>
 
-#include <boost/filesystem/operations.hpp>
+#include <boost/filesystem/path.hpp>
 
 #include "daemon/daemon.hpp"
 #include "entry/command_line.hpp"
@@ -19,7 +19,8 @@ namespace {
 std::string write_pid_file(const char* name) {
     if (name == nullptr)
         return {};
-    std::string path = platform::absolute_path(name);
+    platform::os_error ignored;
+    std::string path = platform::absolute_path(name, ignored);
     if (platform::write_pid_file(path, platform::current_process_id()))
         return path;
     the_daemon.log_error("failed to create pid file");
@@ -31,6 +32,8 @@ void choose_what_to_supervise(command_line& options) {
         return;
     auto top = process::create(&the_daemon, std::move(options.command), std::move(options.user),
                                ".", {}, true, stdio_inherit);
+    // Attached before the program's name is known, so its version packet
+    // names no program: peers that attach have always seen it so.
     if (options.attach_pid != 0)
         top->attach(options.attach_pid, options.attach_pipe);
     the_daemon.configure("torvad", nullptr);
@@ -38,7 +41,7 @@ void choose_what_to_supervise(command_line& options) {
 
 void run_at_console() {
     // At a console a plain kill is a stop request too.
-    the_daemon.signals.add(SIGTERM);
+    the_daemon.add_stop_signal(SIGTERM);
     the_daemon.start();
     the_daemon.run();
 }
@@ -46,8 +49,8 @@ void run_at_console() {
 } // namespace
 
 int main(int argc, char** argv) {
-    platform::ensure_standard_descriptors();
-    platform::ignore_broken_pipes();
+    // The start state (standard fds, signal dispositions) was made before the
+    // daemon was built; see daemon.cpp.
     // A line is worth seeing at once, also when stdout is a pipe or a journal.
     std::setvbuf(stdout, nullptr, _IOLBF, 0);
     background = !platform::stdout_is_terminal();
@@ -63,18 +66,23 @@ int main(int argc, char** argv) {
     auto_restart = !options.no_restart;
 
     std::string pid_file = write_pid_file(options.pid_file);
-    boost::filesystem::path exe_path = platform::absolute_path(argv[0]);
+    platform::os_error ignored;
+    boost::filesystem::path exe_path = platform::absolute_path(argv[0], ignored);
     if (options.directory.empty())
         options.directory = exe_path.parent_path().string();
+    // A directory that can't be entered leaves us where we started; relative
+    // names are then looked up there. Operators rely on the run going on.
     platform::change_directory(options.directory);
 
     choose_what_to_supervise(options);
-    the_daemon.program_name = exe_path.filename().string();
+    the_daemon.set_program_name(exe_path.filename().string());
 
     if (!background)
         run_at_console();
     else
-        platform::run_service_dispatcher(run_service, service_control_stop);
+        // Outside a service manager this fails at once and nothing was
+        // started: the run simply ends, so its result changes nothing here.
+        (void)platform::run_service_dispatcher(run_service, service_control_stop);
 
     if (!pid_file.empty())
         platform::remove_file(pid_file);

@@ -1,3 +1,4 @@
+// The packet codec: header fields in little-endian order, whatever the host.
 #include "ipc/packet.hpp"
 
 #include <cstring>
@@ -23,8 +24,8 @@ packet_header read_packet_header(const void* in) {
     return {load_u32(bytes), load_u32(bytes + 4), load_u32(bytes + 8), load_u32(bytes + 12)};
 }
 
-std::vector<char> frame_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                               const void* data, std::size_t size) {
+std::vector<char> encode_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                                const void* data, std::size_t size) {
     std::vector<char> packet(size + packet_header_size);
     write_packet_header(packet.data(),
                         {static_cast<std::uint32_t>(packet.size()), channel, type, flags});

@@ -76,8 +76,8 @@ void write_packet_header(void* out, const packet_header& header);
 packet_header read_packet_header(const void* in);
 
 // One whole packet in one block: header with length = size + 16, then the payload.
-std::vector<char> frame_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                               const void* data, std::size_t size);
+std::vector<char> encode_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                                const void* data, std::size_t size);
 
 // The payload of version: program name, version text and "Background:true|false",
 // joined by NUL bytes with none at the end.

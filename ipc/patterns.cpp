@@ -1,61 +1,82 @@
+// The patterns file's lines and the permission decision over them.
 #include "ipc/patterns.hpp"
 
-#include <fstream>
-
-#include "daemon/daemon.hpp"
 #include "ipc/strings.hpp"
 
 namespace torvad {
 
 namespace {
-constexpr std::string_view all_prefix = "(all) ";
-}
 
-void load_patterns(daemon& owner, const char* path) {
-    std::ifstream file(path);
-    if (!file) {
-        owner.log_error("failed to open patterns file '%s'", path);
+constexpr std::string_view all_prefix = "(all) ";
+
+void add_line(pattern_lists& lists, std::string_view line, std::string_view file_name,
+              unsigned number, std::vector<std::string>& problems) {
+    if (line.empty() || line[0] == '#')
+        return;
+    bool for_all = line.substr(0, all_prefix.size()) == all_prefix;
+    std::string error;
+    auto compiled = bounded_regex::compile(for_all ? line.substr(all_prefix.size()) : line, error);
+    if (!compiled) {
+        problems.push_back("bad pattern on line " + std::to_string(number) + " of '" +
+                           std::string(file_name) + "' skipped: " + error);
         return;
     }
-    std::string line;
-    for (unsigned number = 1; std::getline(file, line); ++number) {
-        // A file written elsewhere may end its lines with a carriage return.
-        if (!line.empty() && line.back() == '\r')
-            line.pop_back();
-        if (line.empty() || line[0] == '#')
-            continue;
-        bool for_all = line.compare(0, all_prefix.size(), all_prefix) == 0;
-        try {
-            if (for_all)
-                owner.all_patterns.emplace_back(line.substr(all_prefix.size()),
-                                                std::regex::ECMAScript);
-            else
-                owner.exec_patterns.emplace_back(line, std::regex::ECMAScript);
-        } catch (const std::regex_error& error) {
-            owner.log_error("bad pattern on line %u of '%s' skipped: %s", number, path,
-                            error.what());
-        }
+    (for_all ? lists.all : lists.exec).push_back(std::move(*compiled));
+}
+
+// The verdict of the first pattern that matches; undecided when none
+// matched and one of them could not be decided.
+match_verdict match_any(const std::vector<bounded_regex>& list, std::string_view text) {
+    match_verdict verdict = match_verdict::no_match;
+    for (const auto& pattern : list) {
+        match_verdict one = pattern.match(text);
+        if (one == match_verdict::match)
+            return one;
+        if (one == match_verdict::undecided)
+            verdict = one;
     }
+    return verdict;
 }
 
-bool matches_patterns(const std::vector<std::string>& items, const std::vector<std::regex>& list) {
+} // namespace
+
+pattern_lists parse_patterns(std::string_view text, std::string_view file_name,
+                             std::vector<std::string>& problems) {
+    pattern_lists lists;
+    lists.allow_all = false;
+    unsigned number = 0;
+    while (!text.empty()) {
+        std::size_t end = text.find('\n');
+        std::string_view line = text.substr(0, end);
+        // A line written elsewhere may end in CR LF; the CR is not the pattern's.
+        if (end != std::string_view::npos && !line.empty() && line.back() == '\r')
+            line.remove_suffix(1);
+        add_line(lists, line, file_name, ++number, problems);
+        text.remove_prefix(end == std::string_view::npos ? text.size() : end + 1);
+    }
+    return lists;
+}
+
+permission decide_permission(const pattern_lists& patterns, const std::string& requester_user,
+                             const std::string& wanted_user,
+                             const std::vector<std::string>& items) {
     std::string text = join_strings(items);
-    for (const auto& pattern : list)
-        if (std::regex_match(text, pattern))
-            return true;
-    return false;
-}
-
-const char* permission_refusal(const daemon& owner, const std::string& requester_user,
-                               const std::string& wanted_user,
-                               const std::vector<std::string>& items) {
-    if (wanted_user != requester_user)
-        return matches_patterns(items, owner.all_patterns) ? nullptr
-                                                           : "permission to change user denied";
-    if (owner.allow_all || matches_patterns(items, owner.exec_patterns) ||
-        matches_patterns(items, owner.all_patterns))
-        return nullptr;
-    return "permission to execute denied";
+    if (wanted_user != requester_user) {
+        match_verdict verdict = match_any(patterns.all, text);
+        if (verdict == match_verdict::match)
+            return {};
+        return {"permission to change user denied", verdict == match_verdict::undecided};
+    }
+    if (patterns.allow_all)
+        return {};
+    match_verdict own = match_any(patterns.exec, text);
+    if (own == match_verdict::match)
+        return {};
+    match_verdict any = match_any(patterns.all, text);
+    if (any == match_verdict::match)
+        return {};
+    bool undecided = own == match_verdict::undecided || any == match_verdict::undecided;
+    return {"permission to execute denied", undecided};
 }
 
 } // namespace torvad

@@ -1,25 +1,36 @@
 // The execution patterns: which commands a child may have run, and which of
-// them under another account. Loaded once into the daemon, read-only after.
+// them under another account. Parsed once at start into plain lists that the
+// daemon keeps, read-only after.
 #pragma once
 
-#include <regex>
 #include <string>
+#include <string_view>
 #include <vector>
+
+#include "ipc/bounded_regex.hpp"
 
 namespace torvad {
 
-class daemon;
+struct pattern_lists {
+    // No patterns file: every command under the requester's own account.
+    bool allow_all = true;
+    std::vector<bounded_regex> exec; // lines without a prefix: the own account
+    std::vector<bounded_regex> all;  // lines with "(all) ": any account
+};
 
-// Reads the patterns file into the daemon's lists. A line that is not a valid
-// expression is logged and skipped, so a typo permits less, never more.
-void load_patterns(daemon& owner, const char* path);
+// The lists of a patterns file's text. A line that is not a valid expression
+// is skipped with one text in problems, so a typo permits less, never more.
+pattern_lists parse_patterns(std::string_view text, std::string_view file_name,
+                             std::vector<std::string>& problems);
 
-// True when one expression of list matches the whole NUL-joined item list.
-bool matches_patterns(const std::vector<std::string>& items, const std::vector<std::regex>& list);
-
-// The decision for one request: null when permitted, else the refusal text.
-const char* permission_refusal(const daemon& owner, const std::string& requester_user,
-                               const std::string& wanted_user,
-                               const std::vector<std::string>& items);
+// The decision for one request: refusal is null when permitted, else the
+// text to log. undecided: a pattern could not be matched within its bounds,
+// and the request is refused for that alone.
+struct permission {
+    const char* refusal = nullptr;
+    bool undecided = false;
+};
+permission decide_permission(const pattern_lists& patterns, const std::string& requester_user,
+                             const std::string& wanted_user, const std::vector<std::string>& items);
 
 } // namespace torvad

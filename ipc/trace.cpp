@@ -1,12 +1,11 @@
+// The trace of every packet under -v: labels, previews of stream bytes and
+// the items of string lists.
 #include "ipc/trace.hpp"
 
 #include <cctype>
 #include <cstdio>
 
-#include "daemon/daemon.hpp"
-#include "ipc/packet.hpp"
 #include "ipc/strings.hpp"
-#include "process/process.hpp"
 
 namespace torvad {
 
@@ -69,9 +68,7 @@ std::string channel_label(std::uint32_t channel) {
     return label;
 }
 
-trace_text describe_packet(const char* packet) {
-    packet_header header = read_packet_header(packet);
-    const char* payload = packet + packet_header_size;
+trace_text describe_packet(const packet_header& header, const char* payload) {
     std::uint32_t size = header.length - packet_header_size;
     trace_text text{packet_type_name(header.type), {}};
     switch (header.type) {
@@ -98,15 +95,20 @@ trace_text describe_packet(const char* packet) {
     return text;
 }
 
-void process::trace_packet(const char* packet, bool sent) {
-    // Without -v this is the whole cost of the trace.
-    if (packet == nullptr || !verbose)
-        return;
-    trace_text text = describe_packet(packet);
-    std::string label = channel_label(read_packet_header(packet).channel);
-    owner->log_verbose(
-        owner->colour && !logging ? "\x1b[36m%s %s:%s\x1b[35m %s\x1b[0m %s" : "%s %s:%s %s %s",
-        sent ? "->" : "<-", name.c_str(), label.c_str(), text.type_name, text.details.c_str());
+std::string trace_line(const packet_header& header, const char* payload, bool sent,
+                       std::string_view program, bool colour) {
+    trace_text text = describe_packet(header, payload);
+    std::string line;
+    line += colour ? "\x1b[36m" : "";
+    line += sent ? "-> " : "<- ";
+    line += program;
+    line += ':';
+    line += channel_label(header.channel);
+    line += colour ? "\x1b[35m " : " ";
+    line += text.type_name;
+    line += colour ? "\x1b[0m " : " ";
+    line += text.details;
+    return line;
 }
 
 } // namespace torvad

@@ -79,7 +79,7 @@ bool connection::send(std::uint32_t channel, std::uint32_t type, std::uint32_t f
                       std::string_view payload) {
     if (payload.size() > packet_max_payload)
         return false;
-    auto block = frame_packet(channel, type, flags, payload.data(), payload.size());
+    auto block = encode_packet(channel, type, flags, payload.data(), payload.size());
     std::size_t sent = 0;
     while (sent < block.size()) {
         ssize_t put = ::send(fd_, block.data() + sent, block.size() - sent, MSG_NOSIGNAL);

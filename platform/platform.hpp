@@ -15,22 +15,37 @@ namespace torvad::platform {
 // The executable suffix of this system: empty here, ".exe" on Windows.
 extern const char* const exe_suffix;
 
+// A failed system call: its errno and its name, for a log line that says
+// which call failed and why. code 0 is success.
+struct os_error {
+    int code = 0;
+    const char* call = "";
+    explicit operator bool() const { return code != 0; }
+};
+// "call: reason", e.g. "fork: Resource temporarily unavailable".
+std::string describe(const os_error& error);
+
 // --- the supervisor's own process ---------------------------------------------
 
+// Makes the start state whatever the parent left: fds 0, 1, 2 open (on
+// /dev/null where closed, before anything else takes those numbers), default
+// SIGCHLD so that exits can be waited for, SIGPIPE ignored so that a peer
+// closing its end is a write error, and no signal blocked.
+void prepare_own_process();
 int current_process_id();
 bool stdout_is_terminal();
-// Opens /dev/null on any of fds 0, 1, 2 that is closed, so that no pipe or
-// socket of ours can ever land on a standard descriptor.
-void ensure_standard_descriptors();
-// A peer closing its end must surface as a write error, never kill us.
-void ignore_broken_pipes();
 bool change_directory(const std::string& path);
 std::tm local_time_now();
 // Writes the file "<pid>\n"; false when it can't be created.
 bool write_pid_file(const std::string& path, int pid);
 void remove_file(const std::string& path);
-// The absolute form of path against the current directory, at the time of call.
-std::string absolute_path(const std::string& path);
+// The absolute, normal form of path against the current directory; an error
+// when that directory can't be had (it may have been deleted).
+std::string absolute_path(const std::string& path, os_error& error);
+// The path of an executable found on PATH, or empty.
+std::string search_path(const std::string& name);
+// The whole content of a file.
+os_error read_file(const std::string& path, std::string& content);
 
 // --- the event log --------------------------------------------------------------
 
@@ -41,14 +56,16 @@ void write_event_record(event_type type, const char* text);
 // --- descriptors ----------------------------------------------------------------
 
 void close_descriptor(int fd);
-// A connected pair of stream sockets, both close-on-exec. Returns 0 or errno.
-int make_ipc_pair(int& ours, int& theirs);
+// A connected pair of stream sockets, both close-on-exec.
+os_error make_ipc_pair(int& ours, int& theirs);
+// A pipe, both ends close-on-exec.
+os_error make_pipe(int& read_end, int& write_end);
 // True when fd names an open descriptor.
 bool descriptor_is_open(int fd);
 
 // --- accounts and launching -----------------------------------------------------
 
-// An account resolved before the fork, so the child only makes system calls.
+// An account resolved before the launch, so the child only makes system calls.
 struct account {
     bool change = false; // false: run as ourselves
     unsigned uid = 0;
@@ -69,34 +86,39 @@ struct launch_request {
     stdio_source stdio = stdio_source::inherit;
     int stdio_fds[3] = {-1, -1, -1}; // with stdio_source::descriptors
     int ipc_fd = -1;                 // kept open in the child at the same number
+    bool own_process_group = false;  // keeps a terminal's signals from the child
     account user;
 };
 
-enum class launch_step { none, logon, exec };
+// Where a launch failed: switching to the account, or making the child.
+enum class launch_step { none, logon, create };
 
 struct launch_result {
     int pid = 0;
     int pidfd = -1; // owned by the caller on success
     launch_step failed_step = launch_step::none;
-    int error = 0; // errno of the failed step
+    os_error error;
 };
 
-// Forks and executes the child. The child keeps exactly fds 0, 1, 2 and ipc_fd,
-// starts with default signal dispositions and an empty mask, and any failure
-// before exec is reported back (step and errno) before this returns.
+// Launches the child. It keeps exactly fds 0, 1, 2 and ipc_fd, starts with
+// default signal dispositions, an empty mask and the environment without the
+// service manager's socket, and any failure before exec is known (step, call
+// and errno) when this returns.
 launch_result launch_child(const launch_request& request);
 
 struct exit_status {
     bool ended = false;  // false: still running, the readiness was spurious
     bool exited = false; // false: killed by a signal
     int code = 0;        // exit status, or the signal number
+    os_error error;      // the wait itself failed: the status is unknown
 };
 
-// Reaps the child behind pidfd without blocking, if it has ended. A child that
-// is already gone counts as ended with 0.
+// Reaps the child behind pidfd without blocking, if it has ended.
 exit_status reap_child(int pidfd);
 // Ends the child by force.
 void kill_child(int pidfd);
+// Ends the child by force, reaps it and closes its pidfd, all before returning.
+void end_child_now(int pidfd);
 
 // --- the service manager --------------------------------------------------------
 

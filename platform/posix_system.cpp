@@ -2,28 +2,26 @@
 #include "platform/platform.hpp"
 
 #include <cerrno>
+#include <csignal>
 #include <cstdio>
+#include <cstring>
 #include <fcntl.h>
-#include <signal.h>
 #include <sys/socket.h>
 #include <syslog.h>
 #include <unistd.h>
 
 #include <boost/filesystem/operations.hpp>
+#include <boost/process/search_path.hpp>
 
 namespace torvad::platform {
 
 const char* const exe_suffix = "";
 
-int current_process_id() {
-    return static_cast<int>(getpid());
+std::string describe(const os_error& error) {
+    return std::string(error.call) + ": " + std::strerror(error.code);
 }
 
-bool stdout_is_terminal() {
-    return isatty(STDOUT_FILENO) == 1;
-}
-
-void ensure_standard_descriptors() {
+void prepare_own_process() {
     for (int fd = 0; fd < 3; ++fd) {
         if (fcntl(fd, F_GETFD) != -1)
             continue;
@@ -32,10 +30,21 @@ void ensure_standard_descriptors() {
         if (null_fd != -1 && null_fd != fd)
             close(null_fd);
     }
+    // An inherited SIGCHLD ignore would have the kernel reap our children
+    // before we could read how they ended.
+    signal(SIGCHLD, SIG_DFL);
+    signal(SIGPIPE, SIG_IGN);
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
 }
 
-void ignore_broken_pipes() {
-    signal(SIGPIPE, SIG_IGN);
+int current_process_id() {
+    return static_cast<int>(getpid());
+}
+
+bool stdout_is_terminal() {
+    return isatty(STDOUT_FILENO) == 1;
 }
 
 bool change_directory(const std::string& path) {
@@ -61,10 +70,37 @@ void remove_file(const std::string& path) {
     std::remove(path.c_str());
 }
 
-std::string absolute_path(const std::string& path) {
-    boost::system::error_code error;
-    auto absolute = boost::filesystem::absolute(path, boost::filesystem::current_path(error));
-    return error ? path : absolute.lexically_normal().string();
+std::string absolute_path(const std::string& path, os_error& error) {
+    boost::system::error_code failure;
+    auto directory = boost::filesystem::current_path(failure);
+    if (failure) {
+        error = {failure.value(), "getcwd"};
+        return path;
+    }
+    return boost::filesystem::absolute(path, directory).lexically_normal().string();
+}
+
+std::string search_path(const std::string& name) {
+    return boost::process::search_path(name).string();
+}
+
+os_error read_file(const std::string& path, std::string& content) {
+    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd == -1)
+        return {errno, "open"};
+    char buffer[65536];
+    for (;;) {
+        ssize_t got = read(fd, buffer, sizeof buffer);
+        if (got > 0) {
+            content.append(buffer, static_cast<std::size_t>(got));
+            continue;
+        }
+        if (got == -1 && errno == EINTR)
+            continue;
+        os_error error = got == -1 ? os_error{errno, "read"} : os_error{};
+        close(fd);
+        return error;
+    }
 }
 
 void write_event_record(event_type type, const char* text) {
@@ -86,13 +122,22 @@ void close_descriptor(int fd) {
         close(fd);
 }
 
-int make_ipc_pair(int& ours, int& theirs) {
+os_error make_ipc_pair(int& ours, int& theirs) {
     int fds[2];
     if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) == -1)
-        return errno;
+        return {errno, "socketpair"};
     ours = fds[0];
     theirs = fds[1];
-    return 0;
+    return {};
+}
+
+os_error make_pipe(int& read_end, int& write_end) {
+    int fds[2];
+    if (pipe2(fds, O_CLOEXEC) == -1)
+        return {errno, "pipe2"};
+    read_end = fds[0];
+    write_end = fds[1];
+    return {};
 }
 
 bool descriptor_is_open(int fd) {

@@ -4,19 +4,15 @@
 #include <boost/asio/post.hpp>
 
 #include "daemon/daemon.hpp"
-#include "ipc/packet.hpp"
-#include "platform/platform.hpp"
 
 namespace torvad {
 
 namespace {
-// async_pipe hands out its ends as const only, but closing ours is ours to do.
-void close_write_end(boost::process::async_pipe& pipe) {
-    const_cast<boost::asio::posix::stream_descriptor&>(pipe.sink()).close();
-}
-
 // A child killed by a signal counts as failed, as the shell reports it.
 constexpr std::uint32_t signal_status_base = 128;
+// An exit whose status can't be read is counted as a failure, never as a
+// clean end: a restart is the safer guess.
+constexpr std::uint32_t unknown_status = 0xffffffff;
 } // namespace
 
 void process::on_exit(const boost::system::error_code& error) {
@@ -24,7 +20,7 @@ void process::on_exit(const boost::system::error_code& error) {
     // may be gone: touch nothing.
     if (error)
         return;
-    platform::exit_status exit = platform::reap_child(process_handle.native_handle());
+    platform::exit_status exit = platform::reap_child(exit_watch.native_handle());
     if (!exit.ended) {
         // Readiness is a hint: the loop can hand the stale readiness of a
         // descriptor closed in this turn to one opened after it. Only a reaped
@@ -33,25 +29,24 @@ void process::on_exit(const boost::system::error_code& error) {
         return;
     }
     std::uint32_t code = static_cast<std::uint32_t>(exit.code);
-    if (!exit.exited)
+    if (exit.error) {
+        owner->log_error("failed to read the exit status of '%s'.", name.c_str());
+        owner->log_verbose("%s", platform::describe(exit.error).c_str());
+        code = unknown_status;
+    } else if (!exit.exited) {
         code = forced ? 0 : signal_status_base + code;
-    if (open_streams == 0) {
-        finish(code, packet_closed);
-        return;
     }
-    // All the child wrote is in its pipes now. Dropping our copies of their
-    // write ends lets the reads run to end-of-file, so nothing is lost and
-    // the closing packet still follows the last output.
-    exit_pending = true;
-    pending_status = code;
-    close_write_end(*stdout_pipe);
-    close_write_end(*stderr_pipe);
+    // All the child wrote is in its pipes now. What a descendant still holds
+    // open is not waited for: take what is there and close.
+    drain_output();
+    finish(code, packet_closed);
 }
 
 void process::close_pipes() {
-    for (auto* pipe : {&stdin_pipe, &stdout_pipe, &stderr_pipe})
-        if (*pipe)
-            (*pipe)->close();
+    for (auto* pipe : {&stdin_pipe, &stdout_pipe, &stderr_pipe}) {
+        boost::system::error_code ignored;
+        pipe->close(ignored);
+    }
 }
 
 void process::finish(std::uint32_t exit_status, std::uint32_t end) {
@@ -59,25 +54,23 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     status = exit_status;
     // Closing ends the pending reads and writes before their queues go.
     close_pipes();
-    ipc_pipe.close();
+    boost::system::error_code ignored;
+    ipc_pipe.close(ignored);
+    exit_watch.close(ignored);
     stdin_close_requested = false;
     stdin_queue.clear();
     ipc_queue.clear();
-    ipc_fill = 0;
     channels.clear();
+    // A requester held back by our stdin backlog may read again.
+    if (auto requester = parent.lock())
+        requester->resume_ipc_read();
     if (end_packet == packet_closed) {
         if (status == 0)
             owner->log_info("'%s' exited with 0x%x.", name.c_str(), status);
         else
             owner->log_warning("'%s' exited with 0x%x.", name.c_str(), status);
-        if (status != 0 && auto_restart && persistent) {
-            owner->log_info("starting '%s' again.", name.c_str());
-            // The successor is in children before we leave, so the run never
-            // looks empty across a restart.
-            process::create(owner, command, user, working_directory, {parent, channel}, persistent,
-                            stdio_mode)
-                ->start();
-        }
+        if (status != 0 && auto_restart && persistent)
+            restart();
     }
     // Completions that were already queued when the pipes closed still run and
     // may hold a plain pointer to us; this handler, queued behind them, keeps
@@ -87,14 +80,22 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     owner->remove(self);
 }
 
+void process::restart() {
+    owner->log_info("starting '%s' again.", name.c_str());
+    // The successor is in children before we leave, so the run never looks
+    // empty across a restart.
+    create(owner, command, user, working_directory, {parent, channel}, persistent, stdio_mode)
+        ->start();
+}
+
 void process::terminate() {
     if (persistent) {
         send_packet(0, packet_sigterm, 0, nullptr, 0);
         return;
     }
-    if (process_handle.is_open()) {
+    if (exit_watch.is_open()) {
         forced = true;
-        platform::kill_child(process_handle.native_handle());
+        platform::kill_child(exit_watch.native_handle());
     }
 }
 

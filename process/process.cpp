@@ -5,7 +5,6 @@
 #include <boost/filesystem/path.hpp>
 
 #include "daemon/daemon.hpp"
-#include "ipc/packet.hpp"
 
 namespace torvad {
 
@@ -14,8 +13,10 @@ process::process(daemon* owner, std::vector<std::string> command, std::string us
                  std::int32_t stdio_mode)
     : owner(owner), command(std::move(command)), user(std::move(user)),
       working_directory(std::move(working_directory)), parent(std::move(ref.parent)),
-      channel(ref.channel), persistent(persistent), stdio_mode(stdio_mode), process_handle(*owner),
-      end_packet(packet_failed), ipc_pipe(*owner) {
+      channel(ref.channel), persistent(persistent), stdio_mode(stdio_mode),
+      end_packet(packet_failed), exit_watch(owner->get_executor()),
+      stdin_pipe(owner->get_executor()), stdout_pipe(owner->get_executor()),
+      stderr_pipe(owner->get_executor()), ipc_pipe(owner->get_executor()) {
     // Pipes are relayed to a parent; without a living one there is nowhere to go.
     if (this->stdio_mode == stdio_pipes && parent.expired())
         this->stdio_mode = stdio_none;
@@ -32,15 +33,8 @@ std::shared_ptr<process> process::create(daemon* owner, std::vector<std::string>
                                                  persistent, stdio_mode));
     // The set is the owner from here on, so create never hands out a child
     // that the daemon doesn't know.
-    owner->children.insert(created);
+    owner->adopt(created);
     return created;
-}
-
-std::shared_ptr<process> process::spawn(daemon* owner, std::vector<std::string> command,
-                                        std::string user, std::string working_directory,
-                                        channel_ref ref, bool persistent, std::int32_t stdio_mode) {
-    return create(owner, std::move(command), std::move(user), std::move(working_directory),
-                  std::move(ref), persistent, stdio_mode);
 }
 
 process::~process() {

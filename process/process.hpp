@@ -1,20 +1,34 @@
 // One supervised child: a top-level program, or a channel that another child
-// asked for. Owned by daemon::children from create() to daemon::remove(), and
-// kept alive beyond that only by its pending reads. Parent and channel know
-// each other by weak_ptr alone; the daemon must outlive every process.
+// asked for.
+//
+// Who keeps a process alive:
+// - The daemon's set of children owns it, from create() to daemon::remove().
+// - Each pending read (of the ipc pipe, or a wait for a relayed output pipe)
+//   holds shared_from_this(): the closing packet of a channel, sent by the
+//   destructor, can only follow output that was already read.
+// - The exit wait and the writes hold a plain pointer and act only on
+//   success: they must not keep the object alive, and they can't complete
+//   successfully once finish() has closed their descriptor.
+// - finish() posts a handler holding shared_from_this() behind whatever
+//   completion was already queued when it closed the descriptors, so such a
+//   completion never meets a freed object.
+// Parent and channel know each other by weak_ptr alone. The daemon must
+// outlive every process.
 #pragma once
 
 #include <cstdint>
-#include <deque>
 #include <map>
 #include <memory>
 #include <string>
 #include <vector>
 
+#include <boost/asio/io_context.hpp>
 #include <boost/asio/posix/stream_descriptor.hpp>
-#include <boost/process/async_pipe.hpp>
 
+#include "ipc/execute.hpp"
+#include "ipc/framer.hpp"
 #include "platform/platform.hpp"
+#include "process/byte_queue.hpp"
 
 namespace torvad {
 
@@ -27,7 +41,11 @@ struct channel_ref {
     std::uint32_t channel = 0;
 };
 
-enum stdio_mode_t : std::int32_t { stdio_inherit = 0, stdio_pipes = 1, stdio_none = 2 };
+using descriptor =
+    boost::asio::posix::basic_stream_descriptor<boost::asio::io_context::executor_type>;
+
+// Takes fd into object, non-blocking; on failure fd is still the caller's.
+platform::os_error own_descriptor(descriptor& object, int fd);
 
 class process : public std::enable_shared_from_this<process> {
   public:
@@ -35,43 +53,18 @@ class process : public std::enable_shared_from_this<process> {
                                            std::string user, std::string working_directory,
                                            channel_ref ref, bool persistent,
                                            std::int32_t stdio_mode);
-    virtual ~process();
+    ~process();
     process(const process&) = delete;
     process& operator=(const process&) = delete;
 
-    virtual std::shared_ptr<process> spawn(daemon* owner, std::vector<std::string> command,
-                                           std::string user, std::string working_directory,
-                                           channel_ref ref, bool persistent,
-                                           std::int32_t stdio_mode);
-    virtual bool start();
-    virtual void write_stdin(const char* data, std::uint32_t size);
-    virtual void send_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                             const void* data, std::uint32_t size);
-    virtual void read_output(std::int32_t stream);
-    virtual void read_ipc();
-
-    // end of a child (process/end.cpp)
-    void finish(std::uint32_t status, std::uint32_t end_packet);
-    void on_exit(const boost::system::error_code& error);
+    // Launches the child; false when it could not be (the object has then
+    // left the daemon's set). (process/launch.cpp)
+    bool start();
+    // Serves a pipe another program made instead of launching. (process/ipc_pipe.cpp)
+    void attach(std::int32_t attach_pid, int fd);
+    // Asks a persistent child to stop with sigterm, ends any other by force.
     void terminate();
     void close_pipes();
-
-    // the standard streams (process/streams.cpp)
-    void on_output(const boost::system::error_code& error, std::size_t bytes, std::int32_t stream);
-    void pump_stdin();
-    void pump_ipc();
-
-    // the ipc pipe (ipc/transport.cpp)
-    int create_ipc_pipe(int& error);
-    void on_ipc_read(const boost::system::error_code& error, std::size_t bytes);
-    // Frames the bytes just added behind ipc_fill and acts on every whole packet.
-    void frame_ipc(std::uint32_t bytes);
-    void attach(std::int32_t attach_pid, int fd);
-    // execute requests (ipc/execute.cpp)
-    void handle_execute(const char* packet);
-    void send_and_forget(std::uint32_t channel, std::uint32_t type, std::uint32_t flags);
-    void send_version();
-    void trace_packet(const char* packet, bool sent);
 
     daemon* const owner;
     const std::vector<std::string> command;
@@ -80,42 +73,72 @@ class process : public std::enable_shared_from_this<process> {
     const std::weak_ptr<process> parent;
     const std::uint32_t channel;
     const bool persistent;
-    std::int32_t stdio_mode;
-    boost::asio::posix::stream_descriptor process_handle; // the child's pidfd
-    std::string name;
-    std::uint32_t pid = 0;
-    std::uint32_t end_packet;
-    std::uint32_t status = 0;
-    std::unique_ptr<boost::process::async_pipe> stdin_pipe;
-    std::unique_ptr<boost::process::async_pipe> stdout_pipe;
-    std::unique_ptr<boost::process::async_pipe> stderr_pipe;
-    boost::asio::posix::stream_descriptor ipc_pipe;
-    bool stdin_close_requested = false;
-    std::map<std::uint32_t, std::weak_ptr<process>> channels;
-    std::deque<std::vector<char>> stdin_queue;
-    std::deque<std::vector<char>> ipc_queue;
-    char stdout_buffer[4096];
-    char stderr_buffer[4096];
-    char ipc_buffer[65536];
-    std::uint32_t ipc_fill = 0;
-    // Set when terminate ended the child by force: such an end counts as 0.
-    bool forced = false;
-    // Relayed output streams still being read; an exit waits for them to end.
-    int open_streams = 0;
-    bool exit_pending = false;
-    std::uint32_t pending_status = 0;
 
   private:
     process(daemon* owner, std::vector<std::string> command, std::string user,
             std::string working_directory, channel_ref ref, bool persistent,
             std::int32_t stdio_mode);
 
-    // launch steps (process/launch.cpp)
-    bool fail_launch(std::uint32_t status);
+    // launch (process/launch.cpp)
+    bool fail_launch(std::uint32_t status, const platform::os_error& error);
     bool prepare_stdio(platform::launch_request& request);
-    void watch_child(int pidfd, int child_pid);
+    void watch_child(const platform::launch_result& launched);
     void watch_exit();
-    void route_stdin(const char* packet);
+
+    // end (process/end.cpp)
+    void on_exit(const boost::system::error_code& error);
+    void finish(std::uint32_t status, std::uint32_t end_packet);
+    void restart();
+
+    // relayed standard streams (process/streams.cpp)
+    void wait_output(int stream);
+    void relay_output(int stream);
+    void drain_output();
+    void resume_output();
+    void write_stdin(const char* data, std::uint32_t size, bool close);
+    void pump_stdin();
+    bool stdin_backlogged() const;
+
+    // the ipc pipe (process/ipc_pipe.cpp)
+    platform::os_error create_ipc_pipe(int& theirs);
+    void read_ipc();
+    void on_ipc_read(const boost::system::error_code& error, std::size_t bytes);
+    void on_packet(const packet_header& header, const char* payload);
+    void route_stdin(const packet_header& header, const char* payload);
+    void send_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                     const void* data, std::uint32_t size);
+    void pump_ipc();
+    bool ipc_backlogged() const;
+    void wait_for_room(const std::shared_ptr<process>& writer);
+    void resume_ipc_read();
+    void send_version();
+    void trace_packet(const packet_header& header, const char* payload, bool sent);
+
+    // execute requests (process/execute.cpp)
+    void handle_execute(const packet_header& header, const char* payload);
+    void send_and_forget(std::uint32_t channel, std::uint32_t type, std::uint32_t flags);
+
+    std::int32_t stdio_mode;
+    std::string name;
+    std::uint32_t pid = 0;
+    std::uint32_t end_packet;
+    std::uint32_t status = 0;
+    bool forced = false;   // terminate ended the child by force: its end counts as 0
+    descriptor exit_watch; // the child's pidfd
+
+    descriptor stdin_pipe, stdout_pipe, stderr_pipe; // our ends of the relayed streams
+    byte_queue stdin_queue;
+    bool stdin_writing = false;
+    bool stdin_close_requested = false;
+    bool output_paused[3] = {false, false, false}; // by stream number, 1 and 2
+
+    descriptor ipc_pipe;
+    std::unique_ptr<framer> ipc_in; // made with the pipe: channels have none
+    byte_queue ipc_queue;
+    bool ipc_writing = false;
+    bool ipc_read_paused = false; // a channel's stdin backlog holds the reads back
+    std::map<std::uint32_t, std::weak_ptr<process>> channels;
+    std::vector<std::weak_ptr<process>> waiting_for_room; // channels paused on our queue
 };
 
 } // namespace torvad

@@ -1,97 +1,122 @@
-// The byte paths of a process: a child's output to its parent as packets, the
-// parent's stdin packets to the child, and the queue of the ipc pipe.
+// The relayed standard streams of a channel: its output to the requester as
+// packets, and the requester's stdin packets to the child, both held back
+// when the other side doesn't keep up.
 #include "process/process.hpp"
 
-#include <boost/asio/read.hpp>
-#include <boost/asio/write.hpp>
-
 #include "daemon/daemon.hpp"
-#include "ipc/packet.hpp"
+#include "process/flow.hpp"
 
 namespace torvad {
 
 namespace {
-
-// Writes the whole front entry of queue, which stays queued until the write
-// is done; then drops it and pumps the next. The handler holds a plain
-// pointer: a write must not keep the object alive, and a closed stream
-// completes it with an error, on which it touches nothing.
-template <class Stream>
-void write_front(Stream& stream, std::deque<std::vector<char>>& queue, process* writer,
-                 void (process::*pump)()) {
-    boost::asio::async_write(
-        stream, boost::asio::buffer(queue.front()),
-        [&queue, writer, pump](const boost::system::error_code& error, std::size_t) {
-            if (error)
-                return;
-            // finish may have emptied the queue meanwhile
-            if (!queue.empty())
-                queue.pop_front();
-            (writer->*pump)();
-        });
-}
-
+// Only one handler runs at a time and a read is copied into a packet at
+// once, so every channel reads into this one buffer: an idle channel holds
+// none of its own.
+char relay_buffer[relay_read_size];
 } // namespace
 
-void process::read_output(std::int32_t stream) {
-    auto& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
-    char* buffer = stream == 1 ? stdout_buffer : stderr_buffer;
-    // The read owns the object until it completes, so the closing packet of a
+void process::wait_output(int stream) {
+    descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
+    // The wait owns the object until it completes, so the closing packet of a
     // channel can only follow output that was already read.
-    pipe->async_read_some(boost::asio::buffer(buffer, sizeof stdout_buffer),
-                          [self = shared_from_this(),
-                           stream](const boost::system::error_code& error, std::size_t bytes) {
-                              self->on_output(error, bytes, stream);
-                          });
+    pipe.async_wait(descriptor::wait_read,
+                    [self = shared_from_this(), stream](const boost::system::error_code& error) {
+                        if (!error)
+                            self->relay_output(stream);
+                    });
 }
 
-void process::on_output(const boost::system::error_code& error, std::size_t bytes,
-                        std::int32_t stream) {
-    if (error) {
-        // The last stream to end completes an exit that waited for the output.
-        if (--open_streams == 0 && exit_pending)
-            finish(pending_status, packet_closed);
-        return;
+// Reads what is ready, a few reads per wake so that one busy channel doesn't
+// starve the others, and stops while the requester's queue is full.
+void process::relay_output(int stream) {
+    descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
+    auto requester = parent.lock();
+    for (int reads = 0; reads < relay_reads_per_wake; ++reads) {
+        if (requester && requester->ipc_backlogged()) {
+            output_paused[stream] = true;
+            requester->wait_for_room(shared_from_this());
+            return;
+        }
+        boost::system::error_code error;
+        std::size_t bytes = pipe.read_some(boost::asio::buffer(relay_buffer), error);
+        if (error == boost::asio::error::would_block)
+            break;
+        if (error) {
+            // End of file, or the pipe is gone: this stream is over.
+            pipe.close(error);
+            return;
+        }
+        if (requester)
+            requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0, relay_buffer,
+                                   static_cast<std::uint32_t>(bytes));
     }
-    if (auto requester = parent.lock())
-        requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0,
-                               stream == 1 ? stdout_buffer : stderr_buffer,
-                               static_cast<std::uint32_t>(bytes));
-    read_output(stream);
+    wait_output(stream);
 }
 
-void process::write_stdin(const char* data, std::uint32_t size) {
-    bool idle = stdin_queue.empty();
-    if (size != 0)
-        stdin_queue.emplace_back(data, data + size);
+void process::resume_output() {
+    for (int stream : {1, 2}) {
+        if (output_paused[stream]) {
+            output_paused[stream] = false;
+            relay_output(stream);
+        }
+    }
+}
+
+void process::drain_output() {
+    auto requester = parent.lock();
+    for (int stream : {1, 2}) {
+        descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
+        boost::system::error_code error;
+        // The child is gone, so what is in the pipe is all there will be from
+        // it; the queue's mark doesn't hold this back, the pipe's size bounds it.
+        while (pipe.is_open()) {
+            std::size_t bytes = pipe.read_some(boost::asio::buffer(relay_buffer), error);
+            if (error)
+                break;
+            if (requester)
+                requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0, relay_buffer,
+                                       static_cast<std::uint32_t>(bytes));
+        }
+        output_paused[stream] = false;
+    }
+}
+
+void process::write_stdin(const char* data, std::uint32_t size, bool close) {
+    stdin_queue.push(data, size);
+    stdin_close_requested = stdin_close_requested || close;
     // A write in flight drains the queue by itself, a requested close included.
-    if (idle)
+    if (!stdin_writing)
         pump_stdin();
 }
 
 void process::pump_stdin() {
-    if (!stdin_pipe || !stdin_pipe->is_open())
+    stdin_writing = false;
+    if (!stdin_pipe.is_open())
         return;
     if (stdin_queue.empty()) {
-        if (stdin_close_requested)
-            stdin_pipe->close();
+        if (stdin_close_requested) {
+            boost::system::error_code ignored;
+            stdin_pipe.close(ignored);
+        }
         return;
     }
-    write_front(*stdin_pipe, stdin_queue, this, &process::pump_stdin);
+    stdin_writing = true;
+    // A write holds a plain pointer: it must not keep the object alive, and a
+    // closed pipe completes it with an error, on which it touches nothing.
+    stdin_pipe.async_write_some(stdin_queue.front(),
+                                [this](const boost::system::error_code& error, std::size_t n) {
+                                    if (error)
+                                        return;
+                                    stdin_queue.consume(n);
+                                    pump_stdin();
+                                    if (stdin_queue.size() < stdin_low_mark)
+                                        if (auto requester = parent.lock())
+                                            requester->resume_ipc_read();
+                                });
 }
 
-void process::send_packet(std::uint32_t channel_id, std::uint32_t type, std::uint32_t flags,
-                          const void* data, std::uint32_t size) {
-    ipc_queue.push_back(frame_packet(channel_id, type, flags, data, size));
-    trace_packet(ipc_queue.back().data(), true);
-    if (ipc_queue.size() == 1)
-        pump_ipc();
-}
-
-void process::pump_ipc() {
-    if (ipc_queue.empty() || !ipc_pipe.is_open())
-        return;
-    write_front(ipc_pipe, ipc_queue, this, &process::pump_ipc);
+bool process::stdin_backlogged() const {
+    return stdin_queue.size() >= stdin_high_mark;
 }
 
 } // namespace torvad

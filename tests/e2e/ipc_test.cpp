@@ -17,7 +17,7 @@ namespace {
 // A packet as the hex the test child writes; "/" splits it into writes.
 std::string hex_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
                        const std::string& payload, std::uint32_t length = 0) {
-    auto bytes = torvad::frame_packet(channel, type, flags, payload.data(), payload.size());
+    auto bytes = torvad::encode_packet(channel, type, flags, payload.data(), payload.size());
     if (length != 0)
         torvad::store_u32(reinterpret_cast<unsigned char*>(bytes.data()), length);
     std::string hex;

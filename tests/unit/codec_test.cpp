@@ -64,7 +64,7 @@ TEST(codec, packets_match_their_bytes) {
          "1f000000 02003000 06000000 09000000 73766300 746f6f6c2e65786500 2d78"},
     };
     for (const auto& r : rows) {
-        auto framed = frame_packet(r.channel, r.type, r.flags, r.payload.data(), r.payload.size());
+        auto framed = encode_packet(r.channel, r.type, r.flags, r.payload.data(), r.payload.size());
         std::string hex, expected = r.hex;
         std::erase(expected, ' ');
         char digits[3];

@@ -20,10 +20,10 @@ TEST(log, line_forms_by_level_colour_and_length) {
         {false, [] { the_daemon.log_info("%s", std::string(5000, 'y').c_str()); },
          "^" + time + " torvad y{4095}\n$"},
     };
-    bool colour = the_daemon.colour;
+    bool colour = the_daemon.colour();
     for (const auto& [coloured, log, pattern] : rows) {
         // The line goes to a file standing in for stdout.
-        the_daemon.colour = coloured;
+        the_daemon.set_colour(coloured);
         std::fflush(stdout);
         std::FILE* sink = std::tmpfile();
         int saved = dup(1);
@@ -38,5 +38,5 @@ TEST(log, line_forms_by_level_colour_and_length) {
         std::fclose(sink);
         EXPECT_TRUE(std::regex_match(line, std::regex(pattern))) << line;
     }
-    the_daemon.colour = colour;
+    the_daemon.set_colour(colour);
 }

@@ -44,8 +44,9 @@ TEST(trace, details_by_packet_type) {
          "\"torvad\" \"1.1.21.0\" \"Background:false\" "},
     };
     for (const auto& r : rows) {
-        auto packet = frame_packet(1, r.type, r.flags, r.payload.data(), r.payload.size());
-        trace_text text = describe_packet(packet.data());
+        auto packet = encode_packet(1, r.type, r.flags, r.payload.data(), r.payload.size());
+        trace_text text =
+            describe_packet(read_packet_header(packet.data()), packet.data() + packet_header_size);
         EXPECT_STREQ(text.type_name, r.name.c_str());
         EXPECT_EQ(text.details, r.details);
     }

@@ -1,0 +1,59 @@
+// Accounts on Linux: the other system's names mapped to local ones, and an
+// account resolved with its groups before a launch.
+#include "platform/platform.hpp"
+
+#include <cerrno>
+#include <grp.h>
+#include <pwd.h>
+#include <strings.h>
+#include <unistd.h>
+
+namespace torvad::platform {
+
+namespace {
+
+std::string local_account_name(const std::string& user, bool& this_machine) {
+    auto slash = user.find('\\');
+    std::string domain = slash == std::string::npos ? std::string() : user.substr(0, slash);
+    std::string name = slash == std::string::npos ? user : user.substr(slash + 1);
+    bool nt_authority = strcasecmp(domain.c_str(), "NT Authority") == 0;
+    this_machine = domain.empty() || domain == "." || nt_authority;
+    // The built-in service accounts of the other system map to local ones.
+    if (nt_authority && (strcasecmp(name.c_str(), "LocalService") == 0 ||
+                         strcasecmp(name.c_str(), "NetworkService") == 0))
+        return "nobody";
+    if ((nt_authority && strcasecmp(name.c_str(), "System") == 0) ||
+        (domain.empty() && strcasecmp(name.c_str(), "LocalSystem") == 0))
+        return "root";
+    return name;
+}
+
+} // namespace
+
+int resolve_account(const std::string& user, account& out) {
+    bool this_machine = false;
+    std::string name = local_account_name(user, this_machine);
+    if (!this_machine)
+        return ENOENT;
+    std::vector<char> buffer(16384);
+    passwd entry{};
+    passwd* found = nullptr;
+    int error = getpwnam_r(name.c_str(), &entry, buffer.data(), buffer.size(), &found);
+    if (found == nullptr)
+        return error != 0 ? error : ENOENT;
+    out.uid = entry.pw_uid;
+    out.gid = entry.pw_gid;
+    out.change = entry.pw_uid != geteuid() || entry.pw_gid != getegid();
+    if (!out.change)
+        return 0;
+    if (geteuid() != 0)
+        return EPERM;
+    int count = 64;
+    std::vector<gid_t> groups(count);
+    while (getgrouplist(name.c_str(), entry.pw_gid, groups.data(), &count) == -1)
+        groups.resize(count);
+    out.groups.assign(groups.begin(), groups.begin() + count);
+    return 0;
+}
+
+} // namespace torvad::platform

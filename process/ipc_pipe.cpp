@@ -1,0 +1,164 @@
+// The ipc pipe of a process: making it, binding one we were given, reading
+// and framing what comes in, and the queue of what goes out.
+#include "process/process.hpp"
+
+#include <cerrno>
+
+#include "daemon/daemon.hpp"
+#include "ipc/trace.hpp"
+#include "process/flow.hpp"
+
+namespace torvad {
+
+platform::os_error process::create_ipc_pipe(int& theirs) {
+    int ours = -1;
+    platform::os_error error = platform::make_ipc_pair(ours, theirs);
+    if (!error)
+        error = own_descriptor(ipc_pipe, ours);
+    if (error) {
+        if (!ipc_pipe.is_open())
+            platform::close_descriptor(ours);
+        platform::close_descriptor(theirs);
+        theirs = -1;
+        return error;
+    }
+    ipc_in = std::make_unique<framer>();
+    return {};
+}
+
+void process::attach(std::int32_t attach_pid, int fd) {
+    platform::os_error error{EBADF, "fcntl"};
+    if (platform::descriptor_is_open(fd))
+        error = own_descriptor(ipc_pipe, fd);
+    if (error) {
+        owner->log_error("failed to attach to ipc pipe.");
+        owner->log_verbose("%s", platform::describe(error).c_str());
+        return;
+    }
+    ipc_in = std::make_unique<framer>();
+    pid = static_cast<std::uint32_t>(attach_pid);
+    read_ipc();
+    send_version();
+}
+
+void process::read_ipc() {
+    // The pending read owns the object: see wait_output.
+    ipc_pipe.async_read_some(
+        boost::asio::buffer(ipc_in->free_space(), ipc_in->free_size()),
+        [self = shared_from_this()](const boost::system::error_code& error, std::size_t bytes) {
+            self->on_ipc_read(error, bytes);
+        });
+}
+
+void process::on_ipc_read(const boost::system::error_code& error, std::size_t bytes) {
+    if (!error) {
+        ipc_in->add(
+            bytes,
+            [this](const packet_header& header, const char* payload) {
+                on_packet(header, payload);
+            },
+            [this] { owner->log_error("bad ipc packet length"); });
+        // A channel that doesn't read its stdin holds back the pipe that feeds it.
+        ipc_read_paused = true;
+        resume_ipc_read();
+        return;
+    }
+    // An attached pipe has no child whose exit could end the object, so the
+    // peer closing its end does: otherwise nothing could ever end the run.
+    if (pid != 0 && !exit_watch.is_open() && ipc_pipe.is_open()) {
+        owner->log_info("attached ipc pipe closed.");
+        finish(0, packet_failed);
+    }
+}
+
+void process::resume_ipc_read() {
+    if (!ipc_read_paused || !ipc_pipe.is_open())
+        return;
+    for (const auto& [id, weak] : channels)
+        if (auto target = weak.lock(); target && target->stdin_backlogged())
+            return;
+    ipc_read_paused = false;
+    read_ipc();
+}
+
+void process::on_packet(const packet_header& header, const char* payload) {
+    trace_packet(header, payload, false);
+    if (header.type == packet_stdin)
+        route_stdin(header, payload);
+    else if (header.type == packet_execute)
+        handle_execute(header, payload);
+}
+
+void process::route_stdin(const packet_header& header, const char* payload) {
+    auto entry = channels.find(header.channel);
+    if (entry == channels.end()) {
+        owner->log_error("channel 0x%x does not exist", header.channel);
+        return;
+    }
+    auto target = entry->second.lock();
+    if (!target || target->stdio_mode != stdio_pipes) {
+        owner->log_error("channel 0x%x standard input is not available", header.channel);
+        return;
+    }
+    target->write_stdin(payload, header.length - packet_header_size,
+                        (header.flags & stdin_close) != 0);
+}
+
+void process::send_packet(std::uint32_t channel_id, std::uint32_t type, std::uint32_t flags,
+                          const void* data, std::uint32_t size) {
+    ipc_queue.push_packet(channel_id, type, flags, data, size);
+    if (verbose) {
+        packet_header header{size + packet_header_size, channel_id, type, flags};
+        trace_packet(header, static_cast<const char*>(data), true);
+    }
+    if (!ipc_writing)
+        pump_ipc();
+}
+
+void process::pump_ipc() {
+    ipc_writing = false;
+    if (ipc_queue.empty() || !ipc_pipe.is_open())
+        return;
+    ipc_writing = true;
+    // A write holds a plain pointer: see pump_stdin.
+    ipc_pipe.async_write_some(
+        ipc_queue.front(), [this](const boost::system::error_code& error, std::size_t bytes) {
+            if (error)
+                return;
+            ipc_queue.consume(bytes);
+            pump_ipc();
+            if (ipc_queue.size() < ipc_low_mark && !waiting_for_room.empty()) {
+                auto waiting = std::move(waiting_for_room);
+                waiting_for_room.clear();
+                for (const auto& weak : waiting)
+                    if (auto writer = weak.lock())
+                        writer->resume_output();
+            }
+        });
+}
+
+bool process::ipc_backlogged() const {
+    return ipc_queue.size() >= ipc_high_mark;
+}
+
+void process::wait_for_room(const std::shared_ptr<process>& writer) {
+    for (const auto& weak : waiting_for_room)
+        if (weak.lock() == writer)
+            return;
+    waiting_for_room.push_back(writer);
+}
+
+void process::send_version() {
+    std::string payload = version_payload(owner->program_name(), daemon_version, background);
+    send_packet(0, packet_version, 0, payload.data(), static_cast<std::uint32_t>(payload.size()));
+}
+
+void process::trace_packet(const packet_header& header, const char* payload, bool sent) {
+    // Without -v this is the whole cost of the trace.
+    if (!verbose)
+        return;
+    std::string line = trace_line(header, payload, sent, name, owner->colour() && !logging);
+    owner->log_verbose("%s", line.c_str());
+}
+
+} // namespace torvad
