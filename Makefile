@@ -2,9 +2,9 @@
 PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libsystemd-dev libgtest-dev \
             libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-14-dev \
             clang-format pkg-config
-FUZZ_SECONDS ?= 60
+FUZZ_SECONDS ?= 30
 
-.PHONY: all deps build run test test-asan fuzz bench format clean
+.PHONY: all deps build run test test-asan fuzz bench format format-check clean
 
 all: build
 
@@ -22,8 +22,10 @@ build: deps build/build.ninja
 run: build
 	./build/torvad -d examples/demo -- $(CURDIR)/build/peer_example
 
-# The sanitizer run and the fuzzer first, so the summary of the plain run ends the output.
+# The format check, the sanitizer run and the fuzzers first, so the summary of
+# the plain run ends the output.
 test: build
+	$(MAKE) format-check
 	$(MAKE) test-asan
 	$(MAKE) fuzz
 	ctest --test-dir build --output-on-failure -j2
@@ -40,12 +42,15 @@ build-fuzz/build.ninja:
 	CXX=clang++ cmake -S . -B build-fuzz -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
 	  -DTORVAD_FUZZ=ON -DTORVAD_SANITIZE=ON
 
+# Each target for FUZZ_SECONDS, from its committed seeds and the corpus it grew before.
+FUZZ_TARGETS := framing execute
 fuzz: deps build-fuzz/build.ninja
-	cmake --build build-fuzz --target fuzz_framing
-	mkdir -p build-fuzz/corpus
-	./build-fuzz/fuzz/fuzz_framing -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
-	  -artifact_prefix=build-fuzz/ \
-	  build-fuzz/corpus fuzz/seeds
+	cmake --build build-fuzz --target $(addprefix fuzz_,$(FUZZ_TARGETS))
+	for target in $(FUZZ_TARGETS); do \
+	  mkdir -p build-fuzz/corpus_$$target && \
+	  ./build-fuzz/fuzz/fuzz_$$target -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	    -artifact_prefix=build-fuzz/ build-fuzz/corpus_$$target fuzz/seeds_$$target || exit 1; \
+	done
 
 bench: build
 	./build/bench/bench_framing
@@ -53,6 +58,9 @@ bench: build
 
 format:
 	clang-format -i $$(git ls-files '*.cpp' '*.hpp')
+
+format-check: deps
+	clang-format --dry-run -Werror $$(git ls-files '*.cpp' '*.hpp')
 
 clean:
 	rm -rf build build-asan build-fuzz
