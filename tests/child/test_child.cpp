@@ -10,6 +10,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <string>
+#include <sys/socket.h>
 #include <unistd.h>
 #include <vector>
 
@@ -45,14 +46,19 @@ bool create_once(const std::string& path) {
     return true;
 }
 
-// Reads version, then reports every packet until sigterm or end of stream.
-int serve(connection& link, bool obey_sigterm) {
+// Reads version and reports it; false when the first packet isn't one.
+bool greet(connection& link) {
     peer::version_info version;
     if (!peer::read_version(link, version))
-        return 5;
+        return false;
     say("version %s %s Background:%s", version.program_name.c_str(), version.version.c_str(),
         version.background ? "true" : "false");
     say("ready pid=%d", getpid());
+    return true;
+}
+
+// Reports every packet until sigterm or end of stream.
+int await_sigterm(connection& link, bool obey_sigterm) {
     peer::packet packet;
     while (link.receive(packet)) {
         if (packet.header.type != packet_sigterm)
@@ -68,7 +74,7 @@ int serve(const context& how, bool obey_sigterm) {
     if (how.ipc_fd < 0)
         return 0;
     connection link(how.ipc_fd);
-    return serve(link, obey_sigterm);
+    return greet(link) ? await_sigterm(link, obey_sigterm) : 5;
 }
 
 int mode_exit(const context& how) {
@@ -213,6 +219,84 @@ int mode_relay(const context& how) {
     return 4;
 }
 
+// Sends one execute per request, on channels 1, 2, ...: each request is its
+// flags, then its items, and "+" separates requests; "!rmcwd" instead removes
+// the working directory first. Reports every end, and stdout, per channel.
+int mode_execute(const context& how) {
+    connection link(how.ipc_fd);
+    greet(link);
+    std::vector<std::vector<std::string>> requests(1);
+    for (const auto& arg : how.args) {
+        if (arg == "+")
+            requests.emplace_back();
+        else
+            requests.back().push_back(arg);
+    }
+    std::uint32_t sent = 0;
+    for (auto& request : requests) {
+        char cwd[4096];
+        if (request.size() == 1 && request[0] == "!rmcwd" && getcwd(cwd, sizeof cwd))
+            say("rmcwd %d", rmdir(cwd));
+        else if (request.size() > 1)
+            link.execute(++sent, std::stoul(request[0]), {request.begin() + 1, request.end()});
+    }
+    peer::packet packet;
+    for (std::uint32_t ended = 0; ended < sent && link.receive(packet);) {
+        const auto& h = packet.header;
+        if (h.type == packet_sigterm)
+            return 0;
+        if (h.type == packet_stdout)
+            say("%u stdout %s", h.channel, packet.payload.c_str());
+        else if (h.type == packet_failed || h.type == packet_closed)
+            say("%u %s %u", h.channel, packet_type_name(h.type), h.flags), ++ended;
+    }
+    return await_sigterm(link, true);
+}
+
+// Writes MiB mebibytes to stdout, then creates the marker file.
+int mode_write(const context& how) {
+    std::string block(1 << 20, 'w');
+    for (int i = 0; i < how.number(0); ++i)
+        if (write(1, block.data(), block.size()) != ssize_t(block.size()))
+            return 1;
+    create_once(how.args[1]);
+    return 0;
+}
+
+// A peer that stops reading while a channel floods it: it reads again when
+// the writer is done or after two seconds, and counts what arrives.
+int mode_flood_out(const context& how) {
+    connection link(how.ipc_fd);
+    greet(link);
+    std::string marker = how.args[1];
+    link.execute(1, execute_stdio_pipes, {how.self, "write", how.args[0], marker});
+    for (int waited = 0; waited < 200 && access(marker.c_str(), F_OK) != 0; ++waited)
+        usleep(10000);
+    std::size_t bytes = 0;
+    peer::packet packet;
+    while (link.receive(packet) && packet.header.type != packet_closed)
+        bytes += packet.header.type == packet_stdout ? packet.payload.size() : 0;
+    say("flood-out %zu bytes closed %u", bytes, packet.header.flags);
+    return await_sigterm(link, true);
+}
+
+// A peer that floods the stdin of a channel that never reads it; a send that
+// can't go out within half a second means the supervisor holds back.
+int mode_flood_in(const context& how) {
+    connection link(how.ipc_fd);
+    greet(link);
+    link.execute(1, execute_stdio_pipes, {"sleep", "3"});
+    timeval limit{0, 500000};
+    setsockopt(how.ipc_fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
+    std::string chunk(packet_max_payload, 'i');
+    std::size_t sent = 0;
+    while (sent < (std::size_t(256) << 20) && link.send_stdin(1, chunk))
+        sent += chunk.size();
+    say("flood-in %s after %zu MiB", sent < (std::size_t(256) << 20) ? "held" : "sent all",
+        sent >> 20);
+    return await_sigterm(link, true);
+}
+
 struct mode {
     const char* name;
     int (*run)(const context&);
@@ -236,6 +320,10 @@ const mode modes[] = {
     {"close-ipc", mode_close_ipc},
     {"spawn-once", mode_spawn_once},
     {"relay", mode_relay},
+    {"execute", mode_execute},
+    {"write", mode_write},
+    {"flood-out", mode_flood_out},
+    {"flood-in", mode_flood_in},
 };
 
 } // namespace

@@ -11,6 +11,7 @@
 #include <poll.h>
 #include <pty.h>
 #include <sstream>
+#include <sys/resource.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <termios.h>
@@ -49,9 +50,23 @@ void open_output(bool terminal, int& ours, int& theirs) {
     fcntl(ours, F_SETFD, FD_CLOEXEC);
 }
 
+// In a session of its own, so that a signal to its group reaches only it
+// and what it starts.
 [[noreturn]] void exec_daemon(const std::vector<std::string>& args, const options& how, int out) {
+    setsid();
+    unsetenv("NOTIFY_SOCKET");
     int null_fd = open("/dev/null", O_RDONLY);
     dup2(null_fd, 0);
+    if (how.close_stdin)
+        close(0);
+    if (how.ignore_sigchld)
+        signal(SIGCHLD, SIG_IGN);
+    if (how.fd_limit != 0) {
+        rlimit limit{rlim_t(how.fd_limit), rlim_t(how.fd_limit)};
+        setrlimit(RLIMIT_NOFILE, &limit);
+    }
+    for (const auto& variable : how.env)
+        putenv(const_cast<char*>(variable.c_str()));
     dup2(out, 1);
     dup2(out, 2);
     for (int fd = 3; fd < 1024; ++fd)
@@ -60,7 +75,6 @@ void open_output(bool terminal, int& ours, int& theirs) {
     fcntl(how.inherit, F_SETFD, 0);
     if (!how.directory.empty() && chdir(how.directory.c_str()) == -1)
         _exit(126);
-    unsetenv("NOTIFY_SOCKET");
     std::vector<char*> argv{const_cast<char*>(torvad_binary)};
     for (const auto& arg : args)
         argv.push_back(const_cast<char*>(arg.c_str()));
@@ -162,8 +176,12 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
         std::string text = step.substr(1);
         if (step[0] == '?')
             EXPECT_TRUE(run.wait_for(text)) << "waited for: " << text << "\n" << run.output();
+        else if (step == "!GROUP")
+            kill(-run.pid(), SIGINT);
         else if (step[0] == '!')
             run.signal(text == "INT" ? SIGINT : SIGTERM);
+        else if (step[0] == 'M')
+            EXPECT_LT(peak_memory_kib(run.pid()), std::atoi(text.c_str()) * 1024);
         else if (step[0] == '#')
             child = std::atoi(run.wait_value(text).c_str());
         else if (step.rfind("kill ", 0) == 0 && child > 0)
@@ -199,6 +217,12 @@ std::string read_file(const std::string& path) {
     std::stringstream text;
     text << file.rdbuf();
     return text.str();
+}
+
+long peak_memory_kib(pid_t pid) {
+    std::string status = read_file("/proc/" + std::to_string(pid) + "/status");
+    auto peak = status.find("VmHWM:");
+    return peak == std::string::npos ? -1 : std::atol(status.c_str() + peak + 6);
 }
 
 int zombie_children(pid_t pid) {

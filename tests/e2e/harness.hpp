@@ -17,6 +17,11 @@ struct options {
     int inherit = -1;             // one more fd the daemon keeps
     std::vector<std::string> env; // NAME=value added to the environment
     std::string directory;        // where it starts; empty: ours
+    // The start state a careless parent may leave: a low fd limit, stdin
+    // closed, SIGCHLD ignored.
+    int fd_limit = 0;
+    bool close_stdin = false;
+    bool ignore_sigchld = false;
 };
 
 class daemon_run {
@@ -51,6 +56,8 @@ class daemon_run {
 //   "#key"  takes the pid behind "key=" as the child "kill N" sends signal N to it
 //   "=N"    expects exit code N                     "-text" text never appears
 //   "+text" text appears anywhere                    "Z" no child of torvad is a zombie
+//   "!GROUP" SIGINT to torvad's process group, as a terminal's Ctrl-C
+//   "M<n>"  torvad's peak memory stayed below n MiB
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
                   const options& how = {});
 
@@ -63,6 +70,8 @@ struct scratch_dir {
 
 bool file_exists(const std::string& path);
 std::string read_file(const std::string& path);
+// The peak resident memory of pid, in KiB.
+long peak_memory_kib(pid_t pid);
 // Children of pid that are zombies.
 int zombie_children(pid_t pid);
 

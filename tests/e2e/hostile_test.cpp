@@ -1,0 +1,65 @@
+// Children are not trusted, and neither is the start state: each row is a
+// fault that once took the supervisor down, stalled it or grew it without
+// bound. The run must go on and end in order.
+#include <gtest/gtest.h>
+
+#include "tests/e2e/harness.hpp"
+
+using namespace e2e;
+
+namespace {
+
+std::vector<std::string> requests(std::vector<std::string> args) {
+    args.insert(args.begin(), {"--", child_binary, "execute"});
+    return args;
+}
+
+} // namespace
+
+TEST(hostile, faults_leave_the_supervisor_serving) {
+    scratch_dir dir, doomed;
+    const std::string marker = dir.path + "/written", pipes = "2";
+    std::vector<std::string> many_channels;
+    for (int i = 0; i < 40; ++i)
+        many_channels.insert(many_channels.end(), {pipes, "/bin/sleep", "1", "+"});
+    struct row {
+        std::vector<std::string> args, steps;
+        options how = {};
+    };
+    const row rows[] = {
+        // refusals carry their statuses: malformed, not permitted, not found
+        {requests({"8", "only", "+", "0", "", "+", "8", "someone_else", "/bin/true", "+", "0",
+                   "no_such_program_xyz"}),
+         {"?user not specified", "?executable not specified", "?permission to change user denied",
+          "?executable 'no_such_program_xyz' not found.", "?child: 1 failed 22",
+          "?child: 2 failed 22", "?child: 3 failed 13", "?child: 4 failed 2", "!INT", "=0"}},
+        // out of descriptors: launches fail with the errno, the daemon serves on
+        {requests(many_channels),
+         {"?failed to create child process.", "?failed 24", "!INT", "=0"},
+         {.fd_limit = 64}},
+        // a working directory deleted under us: a relative name is not found
+        {{"-d", doomed.path, "--", child_binary, "execute", "!rmcwd", "+", "0", "./prog"},
+         {"?child: rmcwd 0", "?executable './prog' not found.", "?child: 1 failed 2", "!INT",
+          "=0"}},
+        // a grandchild holding the pipe does not hold back the channel's end
+        {requests({pipes, "/bin/sh", "-c", "sleep 5 & echo hi"}),
+         {"?child: 1 stdout hi", "?child: 1 closed 0", "!INT", "=0"}},
+        // a peer that stops reading a flood, and one that floods a child's stdin
+        {{"--", child_binary, "flood-out", "256", marker},
+         {"?child: flood-out 268435456 bytes closed 0", "M96", "!INT", "=0"}},
+        {{"--", child_binary, "flood-in"}, {"?child: flood-in held", "M96", "!INT", "=0"}},
+        // a closed stdin at start: the child still gets fds 0, 1, 2 and its pipe
+        {{"--", child_binary, "fds"}, {"?child: fds clean", "!INT", "=0"}, {.close_stdin = true}},
+        // an inherited SIGCHLD ignore must not hide exits from us
+        {{"--", child_binary, "fail-once", dir.path + "/failed"},
+         {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "!INT", "=0"},
+         {.ignore_sigchld = true}},
+        // Ctrl-C reaches the terminal's whole group; the child ends by sigterm
+        {{"--", child_binary, "peer"},
+         {"?child: ready", "!GROUP", "?child: sigterm", "?'test_child' exited with 0x0.", "=0"}},
+    };
+    for (const auto& r : rows) {
+        SCOPED_TRACE(::testing::PrintToString(r.args).substr(0, 200));
+        run_scenario(r.args, r.steps, r.how);
+    }
+}
