@@ -4,6 +4,7 @@
 // parent), so that each figure is taken exactly when the state is reached.
 // Two runs: the channels, then the relay, whose peak must not count them.
 //   bench_memory [path of torvad]
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <string>
@@ -22,6 +23,8 @@ constexpr std::uint32_t first_channel = 1 << 20;
 constexpr int run_limit_s = 300;
 // Each piped channel holds some seven descriptors in torvad: pipe ends and a pidfd.
 constexpr rlim_t descriptors_wanted = 16384;
+
+using figures = std::map<std::string, std::vector<double>>;
 
 // Opens channels [from, to), each a cat on pipes that runs until its stdin
 // closes; true once all are open.
@@ -101,18 +104,32 @@ void raise_descriptor_limit() {
     setrlimit(RLIMIT_NOFILE, &limit);
 }
 
-void print_table(std::map<std::string, std::vector<double>>& channels,
-                 std::map<std::string, std::vector<double>>& relay) {
+void row(const std::string& label, double kib, int decimals, const std::string& note) {
+    std::printf("  %-38s %8.*f%s\n", label.c_str(), decimals, kib, note.c_str());
+}
+
+void print_table(figures& channels, figures& relay) {
     double idle = channels["idle"][0];
-    std::printf("torvad memory                                KiB\n");
-    std::printf("  idle, one child (VmRSS)             %10.0f\n", idle);
+    std::printf("torvad memory, KiB\n");
+    row("idle, one child (VmRSS)", idle, 0, "");
     for (std::uint32_t count : channel_counts) {
         double rss = channels["channels" + std::to_string(count)][0];
-        std::printf("  per piped channel, %4u open         %10.1f   (VmRSS %.0f)\n", count,
-                    (rss - idle) / count, rss);
+        row("per piped channel, " + std::to_string(count) + " open", (rss - idle) / count, 1,
+            "  (VmRSS " + std::to_string(long(rss)) + ")");
     }
-    std::printf("  peak during a %u MiB relay (VmHWM) %9.0f   (idle before it %.0f)\n", relay_mib,
-                relay["peak"][0], relay["idle"][0]);
+    double peak = relay["peak"][0], before = relay["idle"][0];
+    row("peak during a " + std::to_string(relay_mib) + " MiB relay (VmHWM)", peak, 0,
+        "  (+" + std::to_string(long(peak - before)) + " over that run's idle)");
+}
+
+// Every figure there, once, and read: a missing /proc field reads as -1.
+bool complete(const figures& read, std::size_t expected) {
+    if (read.size() != expected)
+        return false;
+    for (const auto& [key, values] : read)
+        if (values.size() != 1 || values[0] <= 0)
+            return false;
+    return true;
 }
 
 } // namespace
@@ -134,10 +151,10 @@ int main(int argc, char** argv) {
     std::string channels_file = scratch.file("channels"), relay_file = scratch.file("relay");
     bool ended = run_under_torvad(torvad, "channels-peer", channels_file, run_limit_s) &&
                  run_under_torvad(torvad, "relay-peer", relay_file, run_limit_s);
-    auto channels = read_results(channels_file), relay = read_results(relay_file);
-    if (!ended || channels.size() != 1 + std::size(channel_counts) || relay.size() != 2) {
-        std::fprintf(stderr, "incomplete run: %zu of %zu channel figures, %zu of 2 relay figures\n",
-                     channels.size(), 1 + std::size(channel_counts), relay.size());
+    figures channels = read_results(channels_file), relay = read_results(relay_file);
+    if (!ended || !complete(channels, 1 + std::size(channel_counts)) || !complete(relay, 2)) {
+        std::fprintf(stderr, "incomplete run: %zu channel figures, %zu relay figures\n",
+                     channels.size(), relay.size());
         return 1;
     }
     print_table(channels, relay);
