@@ -55,6 +55,9 @@ fuzz: deps build-fuzz/build.ninja
 bench: build
 	./build/bench/bench_framing
 	./build/bench/bench_restart
+	./build/bench/bench_execute
+	./build/bench/bench_relay
+	./build/bench/bench_memory
 
 format:
 	clang-format -i $$(git ls-files '*.cpp' '*.hpp')
