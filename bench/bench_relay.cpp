@@ -45,7 +45,7 @@ bool write_all(int fd, const char* data, std::size_t size) {
 }
 
 bool send_packet(int fd, std::uint32_t type, std::uint32_t flags) {
-    auto packet = frame_packet(bare_channel, type, flags, nullptr, 0);
+    auto packet = encode_packet(bare_channel, type, flags, nullptr, 0);
     return write_all(fd, packet.data(), packet.size());
 }
 
