@@ -1,0 +1,102 @@
+// The patterns file and the decisions made over it: what a line permits is
+// exactly what the operator wrote, and a bad line never permits more.
+#include <gtest/gtest.h>
+
+#include "ipc/execute.hpp"
+#include "ipc/strings.hpp"
+
+using namespace torvad;
+
+namespace {
+
+const char* const denied = "permission to execute denied";
+const char* const user_denied = "permission to change user denied";
+
+std::string decided(const pattern_lists& lists, const std::string& wanted,
+                    const std::vector<std::string>& items) {
+    permission result = decide_permission(lists, "svc", wanted, items);
+    return result.refusal == nullptr ? "permitted" : result.refusal;
+}
+
+} // namespace
+
+TEST(patterns, lines_permit_exactly_what_they_say) {
+    std::vector<std::string> problems;
+    const pattern_lists lists = parse_patterns("# a comment\n"
+                                               "/bin/echo\\0.*\n"
+                                               " #not a comment\n"
+                                               "(all) /usr/bin/id\r\n"
+                                               "(all)x\n"
+                                               "(all) ([bad\n"
+                                               "\n"
+                                               "/bin/true\r\n"
+                                               "/bin/last\r",
+                                               "exec.patterns", problems);
+    ASSERT_EQ(problems.size(), 1u);
+    EXPECT_EQ(problems[0].rfind("bad pattern on line 6 of 'exec.patterns' skipped: ", 0), 0u);
+    const std::tuple<std::string, std::vector<std::string>, std::string> rows[] = {
+        {"svc", {"/bin/echo", "hi", ""}, "permitted"},
+        {"svc", {"/bin/echo"}, denied},        // the line spells a second item
+        {"svc", {"x/bin/echo", "hi"}, denied}, // whole text, no search
+        {"svc", {"/bin/ECHO", "hi"}, denied},  // case counts
+        {"svc", {" #not a comment"}, "permitted"},
+        {"svc", {"#not a comment"}, denied},   // nothing trimmed
+        {"svc", {"/usr/bin/id"}, "permitted"}, // an (all) line serves the own account too
+        {"nobody", {"/usr/bin/id"}, "permitted"},
+        {"nobody", {"/bin/echo", "hi"}, user_denied},
+        {"", {"/usr/bin/id", "-u"}, user_denied}, // an empty name is another account
+        {"svc", {"allx"}, "permitted"},           // "(all)x" has no blank: an ordinary line
+        {"svc", {"/bin/true"}, "permitted"},      // CR before LF is not the line's
+        {"svc", {"/bin/last\r"}, "permitted"},    // a last line without LF keeps its CR
+        {"svc", {"/bin/last"}, denied},
+        {"nobody", {"([bad"}, user_denied}, // the bad line permits nothing
+    };
+    for (const auto& [wanted, items, expected] : rows)
+        EXPECT_EQ(decided(lists, wanted, items), expected) << wanted << " " << items[0];
+
+    const pattern_lists open, closed = parse_patterns("# nothing\n", "p", problems);
+    EXPECT_EQ(decided(open, "svc", {"anything"}), "permitted");
+    EXPECT_EQ(decided(open, "nobody", {"anything"}), user_denied);
+    EXPECT_EQ(decided(closed, "svc", {"anything"}), denied);
+}
+
+TEST(patterns, execute_requests_are_refused_with_their_status) {
+    std::vector<std::string> problems;
+    const pattern_lists lists = parse_patterns("/bin/true\n(all) /usr/bin/id\n", "p", problems);
+    struct row {
+        std::uint32_t flags;
+        std::vector<std::string> items;
+        std::string refusal;
+        std::uint32_t status;
+    };
+    const row rows[] = {
+        {execute_user, {"/bin/true"}, "user not specified", status_malformed},
+        {execute_user | execute_path,
+         {"nobody", "/usr/bin/id"},
+         "path not specified",
+         status_malformed},
+        {0, {""}, "executable not specified", status_malformed},
+        {0, {"/bin/false"}, denied, status_not_permitted},
+        {execute_user, {"nobody", "/bin/true"}, user_denied, status_not_permitted},
+        {execute_user | execute_path | execute_stdio_pipes | execute_persistent,
+         {"nobody", "", "/usr/bin/id"},
+         "",
+         0},
+    };
+    for (const auto& r : rows) {
+        std::string payload = join_strings(r.items);
+        execute_decision d =
+            decide_execute(r.flags, payload.data(), payload.size(), "svc", "/srv", lists);
+        EXPECT_EQ(d.refusal == nullptr ? "" : d.refusal, r.refusal) << r.items.back();
+        EXPECT_EQ(d.status, r.status);
+    }
+    std::string payload = join_strings({"nobody", "", "/usr/bin/id"});
+    execute_request accepted = decide_execute(execute_user | execute_path | execute_stdio_none,
+                                              payload.data(), payload.size(), "svc", "/srv", lists)
+                                   .request;
+    EXPECT_EQ(accepted.user, "nobody");
+    EXPECT_EQ(accepted.working_directory, ""); // an empty path is ours
+    EXPECT_EQ(accepted.command, std::vector<std::string>{"/usr/bin/id"});
+    EXPECT_EQ(accepted.stdio_mode, stdio_none);
+    EXPECT_FALSE(accepted.persistent);
+}
