@@ -41,8 +41,8 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         {{"-d", doomed.path, "--", child_binary, "execute", "!rmcwd", "+", "0", "./prog"},
          {"?child: rmcwd 0", "?executable './prog' not found.", "?child: 1 failed 2", "!INT",
           "=0"}},
-        // a grandchild holding the pipe does not hold back the channel's end
-        {requests({pipes, "/bin/sh", "-c", "sleep 5 & echo hi"}),
+        // a grandchild holding the pipe does not hold back the channel's end (past the wait)
+        {requests({pipes, "/bin/sh", "-c", "sleep 12 & echo hi"}),
          {"?child: 1 stdout hi", "?child: 1 closed 0", "!INT", "=0"}},
         // a peer that stops reading a flood, and one that floods a child's stdin
         {{"--", child_binary, "flood-out", "256", marker},
