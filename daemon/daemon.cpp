@@ -45,7 +45,10 @@ void daemon::load_patterns(const char* path) {
 }
 
 void daemon::add_stop_signal(int signal_number) {
-    signals_.add(signal_number);
+    boost::system::error_code error;
+    signals_.add(signal_number, error);
+    if (error)
+        log_verbose("sigaction: %s", error.message().c_str());
 }
 
 void daemon::arm_signal_wait() {
