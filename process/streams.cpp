@@ -82,6 +82,9 @@ void process::drain_output() {
 }
 
 void process::write_stdin(const char* data, std::uint32_t size, bool close) {
+    // Input behind a close, or for a child that closed its end, has nowhere to go.
+    if (!stdin_pipe.is_open())
+        return;
     stdin_queue.push(data, size);
     stdin_close_requested = stdin_close_requested || close;
     // A write in flight drains the queue by itself, a requested close included.
@@ -101,12 +104,18 @@ void process::pump_stdin() {
         return;
     }
     stdin_writing = true;
-    // A write holds a plain pointer: it must not keep the object alive, and a
-    // closed pipe completes it with an error, on which it touches nothing.
+    // A write holds a plain pointer: it must not keep the object alive. When
+    // finish closed the pipe it completes as aborted and touches nothing; any
+    // other failure is the child's end gone, seen while we are in the set.
     stdin_pipe.async_write_some(stdin_queue.front(),
                                 [this](const boost::system::error_code& error, std::size_t n) {
-                                    if (error)
+                                    if (error == boost::asio::error::operation_aborted)
                                         return;
+                                    if (error) {
+                                        boost::system::error_code ignored;
+                                        stdin_pipe.close(ignored);
+                                        stdin_queue.clear();
+                                    }
                                     stdin_queue.consume(n);
                                     pump_stdin();
                                     if (stdin_queue.size() < stdin_low_mark)

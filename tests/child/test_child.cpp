@@ -280,12 +280,14 @@ int mode_flood_out(const context& how) {
     return await_sigterm(link, true);
 }
 
-// A peer that floods the stdin of a channel that never reads it; a send that
-// can't go out within half a second means the supervisor holds back.
+// A peer that floods the stdin of a channel (by default one that never reads
+// it); a send that can't go out within half a second means torvad holds back.
 int mode_flood_in(const context& how) {
     connection link(how.ipc_fd);
     greet(link);
-    link.execute(1, execute_stdio_pipes, {"sleep", "3"});
+    std::vector<std::string> command = how.args;
+    link.execute(1, execute_stdio_pipes,
+                 command.empty() ? std::vector<std::string>{"sleep", "3"} : command);
     timeval limit{0, 500000};
     setsockopt(how.ipc_fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
     std::string chunk(packet_max_payload, 'i');

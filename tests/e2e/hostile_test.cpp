@@ -48,6 +48,9 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         {{"--", child_binary, "flood-out", "256", marker},
          {"?child: flood-out 268435456 bytes closed 0", "M96", "!INT", "=0"}},
         {{"--", child_binary, "flood-in"}, {"?child: flood-in held", "M96", "!INT", "=0"}},
+        // input for a child that closed its stdin is dropped, and holds nothing back
+        {{"--", child_binary, "flood-in", "/bin/sh", "-c", "exec sleep 3 0<&-"},
+         {"?child: flood-in sent all", "!INT", "=0"}},
         // a closed stdin at start: the child still gets fds 0, 1, 2 and its pipe
         {{"--", child_binary, "fds"}, {"?child: fds clean", "!INT", "=0"}, {.close_stdin = true}},
         // an inherited SIGCHLD ignore must not hide exits from us
