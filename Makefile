@@ -28,6 +28,8 @@ run: build
 
 # A Debian package of what `cmake --install` puts in place.
 package: build
+	@command -v dpkg-shlibdeps >/dev/null || \
+	  DEBIAN_FRONTEND=noninteractive apt-get install -y dpkg-dev
 	cd build && cpack -G DEB
 
 # The sanitizer run and the fuzzer first, so the summary of the plain run ends the output.
