@@ -6,6 +6,7 @@
 
 #include "daemon/daemon.hpp"
 #include "entry/command_line.hpp"
+#include "entry/product_start.hpp"
 #include "entry/service.hpp"
 #include "platform/platform.hpp"
 #include "process/process.hpp"
@@ -28,8 +29,14 @@ std::string write_pid_file(const char* name) {
 }
 
 void choose_what_to_supervise(command_line& options) {
-    if (options.command.empty() && options.attach_pid == 0)
+    if (options.command.empty() && options.attach_pid == 0) {
+        // The server program wins when both products are installed here.
+        if (platform::path_exists(std::string("core") + platform::exe_suffix))
+            start_server_family(options.family);
+        else if (platform::path_exists(std::string("wfe") + platform::exe_suffix))
+            start_web_service();
         return;
+    }
     auto top = process::create(&the_daemon, std::move(options.command), std::move(options.user),
                                ".", {}, true, stdio_inherit);
     // Attached before the program's name is known, so its version packet

@@ -2,10 +2,19 @@
 // state reports, with a second run of the loop for the children's orderly end.
 #include "entry/service.hpp"
 
+#include <mutex>
+
 #include "daemon/daemon.hpp"
 #include "platform/platform.hpp"
 
 namespace torvad {
+
+namespace {
+// A stop control ends the first run of the loop only: the second run is the
+// children's orderly end, and a repeated stop request must not cut it short.
+std::mutex first_run_guard;
+bool first_run_over = false;
+} // namespace
 
 void run_service() {
     using platform::service_state;
@@ -14,6 +23,12 @@ void run_service() {
     // Running holds whatever the start did; a failed start shows in the log.
     platform::report_service_state(service_state::running);
     the_daemon.run();
+    {
+        // A stop still on its way has stopped the loop before this point, and
+        // the restart below clears that; one that comes later finds the flag.
+        std::lock_guard<std::mutex> lock(first_run_guard);
+        first_run_over = true;
+    }
     platform::report_service_state(service_state::stop_pending);
     the_daemon.stop();
     the_daemon.restart();
@@ -23,7 +38,9 @@ void run_service() {
 
 void service_control_stop() {
     // Only the first run of the loop ends here; run_service does the rest.
-    the_daemon.io_context::stop();
+    std::lock_guard<std::mutex> lock(first_run_guard);
+    if (!first_run_over)
+        the_daemon.io_context::stop();
 }
 
 } // namespace torvad

@@ -131,3 +131,29 @@ enum class service_state { start_pending, running, stop_pending, stopped };
 void report_service_state(service_state state);
 
 } // namespace torvad::platform
+
+// --- programs run to their end before the supervision starts --------------------
+// (the product's start: the service program check, the init script, the hand-over)
+namespace torvad::platform {
+
+// True when something of any type stands at path (a directory counts too).
+bool path_exists(const std::string& path);
+
+// Which of the program's standard streams comes back to the caller.
+enum class returned_stream { none = 0, output = 1, error = 2 };
+
+struct program_end {
+    int error = 0;      // errno when the program could not be started at all
+    int exit_code = -1; // its exit status, or 128 + the signal that ended it
+};
+
+// Runs the program at path (relative: to the working directory, never searched
+// for) with args behind argv[0] = path, and waits for its end without a time
+// limit. The returned stream is handed to on_output as it arrives, so the
+// program never blocks on a full pipe; its other streams are ours. It gets
+// our environment less NOTIFY_SOCKET, and no descriptor beyond 0, 1 and 2.
+program_end run_program(const std::string& path, const std::vector<std::string>& args,
+                        returned_stream returned,
+                        const std::function<void(const char*, std::size_t)>& on_output);
+
+} // namespace torvad::platform

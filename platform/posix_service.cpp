@@ -2,6 +2,7 @@
 // is set; states go out through sd_notify and SIGTERM is its stop control.
 #include "platform/platform.hpp"
 
+#include <atomic>
 #include <csignal>
 #include <cstdlib>
 #include <pthread.h>
@@ -12,6 +13,7 @@ namespace torvad::platform {
 
 namespace {
 // Sent by the service thread to the first thread when it has reported stopped.
+// It counts only then: one sent from outside wakes the first thread for nothing.
 constexpr int service_ended_signal = SIGUSR2;
 } // namespace
 
@@ -25,19 +27,21 @@ bool run_service_dispatcher(const std::function<void()>& service_main,
     sigaddset(&waited, service_ended_signal);
     // Blocked before the thread starts, so both threads leave these to sigwait.
     pthread_sigmask(SIG_BLOCK, &waited, nullptr);
+    std::atomic<bool> service_ended = false;
     pthread_t first_thread = pthread_self();
     std::thread service([&] {
         service_main();
+        service_ended = true;
         pthread_kill(first_thread, service_ended_signal);
     });
-    for (;;) {
+    while (!service_ended) {
         int signal_number = 0;
-        if (sigwait(&waited, &signal_number) != 0 || signal_number == service_ended_signal)
-            break;
-        on_stop();
+        if (sigwait(&waited, &signal_number) == 0 && signal_number == SIGTERM)
+            on_stop();
     }
     service.join();
-    pthread_sigmask(SIG_UNBLOCK, &waited, nullptr);
+    // Both stay blocked: the process is ending, and a stop request that comes
+    // now must not end it by the default action before the PID file is gone.
     return true;
 }
 

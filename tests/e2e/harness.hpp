@@ -3,6 +3,7 @@
 // what it prints and for its exit.
 #pragma once
 
+#include <functional>
 #include <string>
 #include <sys/types.h>
 #include <vector>
@@ -15,7 +16,7 @@ extern const char* const child_binary;
 struct options {
     bool terminal = true;         // stdout and stderr on a pty, else a pipe
     int inherit = -1;             // one more fd the daemon keeps
-    std::vector<std::string> env; // NAME=value added to the environment
+    std::vector<std::string> env; // NAME=value set in the environment (PATH too)
     std::string directory;        // where it starts; empty: ours
     // The start state a careless parent may leave: a low fd limit, stdin
     // closed, SIGCHLD ignored.
@@ -58,8 +59,10 @@ class daemon_run {
 //   "+text" text appears anywhere                    "Z" no child of torvad is a zombie
 //   "!GROUP" SIGINT to torvad's process group, as a terminal's Ctrl-C
 //   "M<n>"  torvad's peak memory stayed below n MiB
+// A test's own steps, tried before those above; true when it took the step.
+using step_hook = std::function<bool(const std::string& step, daemon_run& run)>;
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
-                  const options& how = {});
+                  const options& how = {}, const step_hook& hook = {});
 
 // A scratch directory removed with its contents at the end of the test.
 struct scratch_dir {

@@ -1,0 +1,18 @@
+// The product's start, chosen by what stands in the working directory: the
+// server family ("core") or the web service ("wfe"). Each makes its one
+// top-level child and configures the daemon; nothing is launched yet.
+#pragma once
+
+#include <string>
+
+namespace torvad {
+
+// Asks core whether to stay in front of it (this may end the process), runs
+// the init script for core's account, and names the service family + "Server".
+// No exception leaves it but those of process::create and daemon::configure.
+void start_server_family(const std::string& family);
+
+// wfe under the local service account, service "WebService", no patterns file.
+void start_web_service();
+
+} // namespace torvad

@@ -1,0 +1,98 @@
+// Programs that the start runs and waits for before any child is supervised:
+// launched like any child (clean descriptors, default signals, no service
+// manager socket), read while they run, and watched through their pidfd so
+// that a grandchild holding the pipe open can't hold the start.
+#include "platform/platform.hpp"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <boost/filesystem/operations.hpp>
+
+namespace torvad::platform {
+
+bool path_exists(const std::string& path) {
+    boost::system::error_code error;
+    auto type = boost::filesystem::status(path, error).type();
+    return type != boost::filesystem::status_error && type != boost::filesystem::file_not_found;
+}
+
+namespace {
+
+using output_handler = std::function<void(const char*, std::size_t)>;
+
+// Once the program has ended, what it wrote is in the pipe: take that and stop,
+// rather than wait for an end of file that a grandchild may never give.
+void drain(int source, const output_handler& on_output) {
+    fcntl(source, F_SETFL, O_NONBLOCK);
+    char buffer[4096];
+    ssize_t got;
+    while ((got = read(source, buffer, sizeof buffer)) > 0 || (got == -1 && errno == EINTR))
+        if (got > 0)
+            on_output(buffer, static_cast<std::size_t>(got));
+}
+
+void relay_until_end(int source, int pidfd, const output_handler& on_output) {
+    char buffer[4096];
+    for (;;) {
+        pollfd ready[2] = {{source, POLLIN, 0}, {pidfd, POLLIN, 0}};
+        if (poll(ready, 2, -1) == -1) {
+            if (errno == EINTR)
+                continue;
+            break;
+        }
+        if (ready[0].revents != 0) {
+            ssize_t got = read(source, buffer, sizeof buffer);
+            if (got > 0)
+                on_output(buffer, static_cast<std::size_t>(got));
+            if (got > 0 || (got == -1 && errno == EINTR))
+                continue;
+            break; // end of file, or an error that ends the stream
+        }
+        if (ready[1].revents != 0) {
+            drain(source, on_output);
+            break;
+        }
+    }
+}
+
+int wait_for_exit_code(int pidfd) {
+    siginfo_t info{};
+    while (waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED) == -1)
+        if (errno != EINTR)
+            return -1;
+    return info.si_code == CLD_EXITED ? info.si_status : 128 + info.si_status;
+}
+
+} // namespace
+
+program_end run_program(const std::string& path, const std::vector<std::string>& args,
+                        returned_stream returned, const output_handler& on_output) {
+    launch_request request;
+    request.executable = path;
+    request.argv.push_back(path);
+    request.argv.insert(request.argv.end(), args.begin(), args.end());
+    int read_end = -1, write_end = -1;
+    if (returned != returned_stream::none) {
+        if (os_error error = make_pipe(read_end, write_end))
+            return {error.code};
+        request.stdio = stdio_source::descriptors;
+        for (int fd = 0; fd < 3; ++fd)
+            request.stdio_fds[fd] = fd == static_cast<int>(returned) ? write_end : fd;
+    }
+    launch_result launched = launch_child(request);
+    close_descriptor(write_end);
+    if (launched.failed_step == launch_step::none && read_end >= 0)
+        relay_until_end(read_end, launched.pidfd, on_output);
+    close_descriptor(read_end);
+    if (launched.failed_step != launch_step::none)
+        return {launched.error.code};
+    program_end end{0, wait_for_exit_code(launched.pidfd)};
+    close_descriptor(launched.pidfd);
+    return end;
+}
+
+} // namespace torvad::platform

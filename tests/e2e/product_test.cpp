@@ -1,0 +1,249 @@
+// The product as the service manager and an installation see it: the service
+// path's state reports on a real NOTIFY_SOCKET, and the start of the server
+// family or web service with stub programs on PATH that record their arguments.
+#include <gtest/gtest.h>
+
+#include <csignal>
+#include <filesystem>
+#include <fstream>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include "tests/e2e/harness.hpp"
+
+using namespace e2e;
+
+namespace {
+
+int bound_datagram_socket(const std::string& path) {
+    int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    path.copy(address.sun_path, sizeof address.sun_path - 1);
+    if (bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == -1)
+        ADD_FAILURE() << "bind " << path;
+    return fd;
+}
+
+// The service manager's end: a datagram socket that torvad reports its states to.
+class notify_socket {
+  public:
+    notify_socket() : fd_(bound_datagram_socket(dir_.path + "/notify")) {}
+    ~notify_socket() { close(fd_); }
+    // The next message, or "" when none comes in time.
+    std::string next(int timeout_ms = 10000) {
+        pollfd ready{fd_, POLLIN, 0};
+        char message[256];
+        ssize_t got = poll(&ready, 1, timeout_ms) == 1 ? recv(fd_, message, sizeof message, 0) : 0;
+        return std::string(message, got > 0 ? got : 0);
+    }
+    std::string env() const { return "NOTIFY_SOCKET=" + dir_.path + "/notify"; }
+
+  private:
+    scratch_dir dir_;
+    int fd_;
+};
+
+// "@message" expects the next state report; "!USR2" sends torvad a SIGUSR2.
+step_hook service_steps(notify_socket& manager) {
+    return [&manager](const std::string& step, daemon_run& run) {
+        if (step == "!USR2") {
+            run.signal(SIGUSR2);
+        } else if (step[0] == '@') {
+            EXPECT_EQ(manager.next(), step.substr(1)) << run.output();
+        }
+        return step == "!USR2" || step[0] == '@';
+    };
+}
+
+std::vector<std::string> child(std::vector<std::string> mode) {
+    mode.insert(mode.begin(), {"--", child_binary});
+    return mode;
+}
+
+} // namespace
+
+TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
+    struct row {
+        std::vector<std::string> args, steps;
+    };
+    const row rows[] = {
+        // a stray SIGUSR2 changes nothing; a SIGTERM after the end can't kill us
+        {child({"peer"}),
+         {"@STATUS=starting", "@READY=1", "?successfully started", "?child: ready", "!USR2",
+          "!TERM", "@STOPPING=1", "?child: sigterm", "?'test_child' exited with 0x0.",
+          "@STATUS=stopped", "!TERM", "=0", "-\x1b"}},
+        // a stop during the start: the first run returns at once, the second
+        // still ends the child through its sigterm
+        {child({"peer"}),
+         {"@STATUS=starting", "!TERM", "@READY=1", "@STOPPING=1", "?child: sigterm",
+          "@STATUS=stopped", "=0"}},
+        // a second stop request must not cut the children's end short
+        {child({"ignore-sigterm"}),
+         {"@STATUS=starting", "@READY=1", "#ready pid", "!TERM", "@STOPPING=1",
+          "?child: sigterm ignored", "!TERM", "kill 9", "?'test_child' exited with 0x89.",
+          "@STATUS=stopped", "=0", "-again"}},
+        {{},
+         {"@STATUS=starting", "?successfully started", "@READY=1", "@STOPPING=1",
+          "?stopping torvad", "@STATUS=stopped", "=0"}},
+        {child({"exit", "0"}),
+         {"@STATUS=starting", "@READY=1", "?exited with 0x0.", "@STOPPING=1", "@STATUS=stopped",
+          "=0"}},
+        {{"--", "no_such_program_xyz"},
+         {"@STATUS=starting", "?failed to start torvad", "@READY=1", "@STOPPING=1",
+          "@STATUS=stopped", "=0"}},
+    };
+    for (const auto& r : rows) {
+        SCOPED_TRACE(::testing::PrintToString(r.args));
+        scratch_dir dir;
+        notify_socket manager;
+        auto args = r.args;
+        args.insert(args.begin(), {"-p", dir.path + "/pid", "-d", dir.path});
+        run_scenario(args, r.steps, {.terminal = false, .env = {manager.env()}},
+                     service_steps(manager));
+        EXPECT_FALSE(file_exists(dir.path + "/pid"));
+        EXPECT_EQ(manager.next(0), "");
+    }
+}
+
+namespace {
+
+// A product directory ("my product", a blank in its path) and a bin directory
+// that is all of torvad's PATH; stubs record their arguments under log/.
+struct installation {
+    installation() {
+        for (const char* sub : {"/my product/scripts", "/bin", "/log"})
+            std::filesystem::create_directories(root.path + sub);
+        // Service accounts must reach the programs here.
+        std::filesystem::permissions(root.path, std::filesystem::perms(0755));
+        std::filesystem::permissions(root.path + "/my product", std::filesystem::perms(0755));
+    }
+    // A shell script; `body` runs with the stub's arguments appended to log/name.
+    void stub(const std::string& path, const std::string& body) {
+        std::string name = std::filesystem::path(path).filename();
+        std::ofstream(root.path + path)
+            << "#!/bin/sh\nPATH=/usr/bin:/bin\n"
+            << "printf '%s\\n' \"$@\" --- >> '" << root.path << "/log/" << name << "'\n"
+            << body << "\n";
+        std::filesystem::permissions(root.path + path, std::filesystem::perms(0755));
+    }
+    std::string log(const std::string& name) { return read_file(root.path + "/log/" + name); }
+    std::string product() const { return root.path + "/my product"; }
+    scratch_dir root;
+};
+
+const char* const answers_version = "[ \"$1\" = -h ] && { echo 'core version 7' >&2; exit 0; }\n"
+                                    "echo core runs as $(id -un)";
+const char* const core_ran = "?core runs as";
+
+} // namespace
+
+TEST(product, server_family_start_takes_core_account_from_init_script) {
+    struct row {
+        const char* init_script; // the body of the powershell stub; null: none on PATH
+        std::vector<std::string> steps;
+        bool unopenable_patterns = false; // present (a socket file) but can't be read
+    };
+    const row rows[] = {
+        {"printf 'no_such\\ruser\\r\\nnobody\\n'",
+         {"?Failed to logon as user 'no_suchuser': error 2", "=0", "-deelevate"}},
+        {"echo root; exit 3",
+         {"?server init script exited with '3', will not deelevate.", core_ran, "=0"}},
+        {nullptr, {"?failed to execute server init script, will not deelevate.", core_ran, "=0"}},
+        // nothing printed: the service manager's socket is kept from the script
+        {"echo $NOTIFY_SOCKET", {core_ran, "=0", "-deelevate", "-failed to open patterns"}},
+        {"printf '\\r\\r\\n'", {core_ran, "=0", "-Failed to logon"}, true},
+        // a megabyte on one line, then more: cut, never blocking
+        {"head -c 1048576 /dev/zero | tr '\\0' x; echo; seq 100000",
+         {"?Failed to logon as user 'xxxxxxxx", "=0"}},
+    };
+    for (const auto& r : rows) {
+        SCOPED_TRACE(r.init_script ? r.init_script : "no powershell");
+        installation site;
+        site.stub("/my product/core", answers_version);
+        if (r.init_script)
+            site.stub("/bin/powershell", r.init_script);
+        auto steps = r.steps;
+        if (r.unopenable_patterns) {
+            close(bound_datagram_socket(site.product() + "/exec.patterns"));
+            steps.push_back("+failed to open patterns file 'exec.patterns'");
+        }
+        run_scenario({"-d", site.product()}, steps,
+                     {.env = {"PATH=" + site.root.path + "/bin", "NOTIFY_SOCKET=/run/x"}});
+        if (r.init_script) {
+            EXPECT_EQ(site.log("powershell"), "-noprofile\n-noninteractive\n-executionpolicy\n"
+                                              "bypass\n-file\n" +
+                                                  site.product() + "/./scripts/init.ps1\n.\n---\n");
+        }
+    }
+}
+
+// core stays silent on "version" (here: usage text, then megabytes): the
+// service is handed over to it and torvad ends with 1, its PID file left.
+TEST(product, silent_core_hands_the_service_over_and_ends_with_1) {
+    const char* const silent_core = "echo 'usage: core' >&2; head -c 3000000 /dev/zero >&2";
+    for (bool task_scheduler : {true, false}) {
+        SCOPED_TRACE(task_scheduler ? "schtasks" : "systemd-run");
+        installation site;
+        site.stub("/my product/core", silent_core);
+        site.stub(task_scheduler ? "/bin/schtasks" : "/bin/systemd-run", "");
+        site.stub("/bin/powershell", "");
+        std::string pid_file = site.root.path + "/pid";
+        run_scenario({"-f", "acme", "-p", pid_file, "-d", site.product()},
+                     {"=1", "-successfully started"}, {.env = {"PATH=" + site.root.path + "/bin"}});
+        EXPECT_TRUE(file_exists(pid_file));
+        EXPECT_EQ(site.log("powershell"), "");
+        std::string core = site.product() + "/core";
+        if (task_scheduler) {
+            EXPECT_EQ(site.log("schtasks"),
+                      "/create\n/f\n/tn\nstartts\n/sc\nonstart\n/ru\nsystem\n/tr\n"
+                      R"(powershell -command "start-sleep -s 10; sc.exe config acmeServer )"
+                      R"(binpath= \\")" +
+                          core +
+                          R"(\\"; sc.exe start torvaSentryServer; schtasks.exe /delete /f /tn )"
+                          "startts\"\n---\n/run\n/tn\nstartts\n---\n");
+            continue;
+        }
+        std::string job = site.log("systemd-run");
+        for (std::string part :
+             {"--on-active=10\n", "--uid=root\n", "/bin/sh\n-c\n",
+              "mkdir -p '/run/systemd/system/acmeServer.service.d'\n", "ExecStart=\n",
+              "systemctl daemon-reload\n", "systemctl start torvaSentryServer\n"})
+            EXPECT_NE(job.find(part), std::string::npos) << part << "\n" << job;
+        EXPECT_NE(job.find("ExecStart=\"" + core + "\"\n"), std::string::npos) << job;
+    }
+}
+
+// What runs where: core wins over wfe; wfe alone runs as the local service
+// account; core runs under the account the init script names, as its own
+// report from inside shows.
+TEST(product, the_working_directory_decides_what_is_supervised) {
+    struct row {
+        std::vector<std::string> programs, steps;
+        bool needs_root = false;
+    };
+    const row rows[] = {
+        {{"core", "wfe"}, {core_ran, "=0", "-wfe runs"}},
+        {{"wfe"}, {"?wfe runs as nobody", "?'wfe' exited with 0x0.", "=0"}, true},
+        {{"wfe"}, {"?Failed to logon as user 'NT Authority\\LocalService'", "=0"}},
+        {{"test_child"}, {"?child: uid=65534 gid=65534", "!INT", "?child: sigterm", "=0"}, true},
+    };
+    for (const auto& r : rows) {
+        if (r.needs_root != (geteuid() == 0))
+            continue;
+        SCOPED_TRACE(r.programs.back());
+        installation site;
+        bool as_nobody = r.programs[0] == "test_child";
+        site.stub("/bin/powershell", as_nobody ? "printf 'nobody\\r\\n'" : "");
+        for (const auto& program : r.programs) {
+            if (program == "test_child")
+                std::filesystem::copy(child_binary, site.product() + "/core");
+            else
+                site.stub("/my product/" + program,
+                          program == "core" ? answers_version : "echo wfe runs as $(id -un)");
+        }
+        run_scenario({"-d", site.product()}, r.steps, {.env = {"PATH=" + site.root.path + "/bin"}});
+    }
+}
