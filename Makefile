@@ -1,7 +1,7 @@
 # The two commands of the README, and the steps they are made of.
-PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libsystemd-dev libgtest-dev \
+PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
             libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-14-dev \
-            clang-format pkg-config
+            clang-format
 FUZZ_SECONDS ?= 30
 
 .PHONY: all deps build run package test test-asan fuzz bench format format-check clean

@@ -46,9 +46,17 @@ void choose_what_to_supervise(command_line& options) {
     the_daemon.configure("torvad", nullptr);
 }
 
+// A stop request can come while the product's start runs its programs. At a
+// console a plain kill is one too, taken by the loop once it runs; under the
+// service manager it waits, blocked, for the dispatcher to act on it.
+void take_stop_requests() {
+    if (background)
+        platform::hold_stop_requests();
+    else
+        the_daemon.add_stop_signal(SIGTERM);
+}
+
 void run_at_console() {
-    // At a console a plain kill is a stop request too.
-    the_daemon.add_stop_signal(SIGTERM);
     the_daemon.start();
     the_daemon.run();
 }
@@ -81,6 +89,7 @@ int main(int argc, char** argv) {
     // names are then looked up there. Operators rely on the run going on.
     platform::change_directory(options.directory);
 
+    take_stop_requests();
     choose_what_to_supervise(options);
     the_daemon.set_program_name(exe_path.filename().string());
 

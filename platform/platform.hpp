@@ -122,6 +122,9 @@ void end_child_now(int pidfd);
 
 // --- the service manager --------------------------------------------------------
 
+// Keeps the service manager's stop request (SIGTERM) pending until the
+// dispatcher waits for it, so that it can't end us by its default action.
+void hold_stop_requests();
 // Runs service_main on a thread of its own when the service manager started us,
 // delivering stop requests to on_stop from this thread; false at once otherwise.
 bool run_service_dispatcher(const std::function<void()>& service_main,
