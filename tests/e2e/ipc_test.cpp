@@ -9,28 +9,11 @@
 #include "ipc/packet.hpp"
 #include "peer/peer.hpp"
 #include "tests/e2e/harness.hpp"
+#include "tests/packet_hex.hpp"
 
 using namespace e2e;
 
-namespace {
-
-// A packet as the hex the test child writes; "/" splits it into writes.
-std::string hex_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                       const std::string& payload, std::uint32_t length = 0) {
-    auto bytes = torvad::encode_packet(channel, type, flags, payload.data(), payload.size());
-    if (length != 0)
-        torvad::store_u32(reinterpret_cast<unsigned char*>(bytes.data()), length);
-    std::string hex;
-    char digits[3];
-    for (char byte : bytes) {
-        std::snprintf(digits, sizeof digits, "%02x", static_cast<unsigned char>(byte));
-        hex += digits;
-    }
-    return hex;
-}
-
-} // namespace
-
+// The test child writes packets given as hex; "/" splits them into writes.
 TEST(ipc, packets_split_and_joined_across_reads_are_framed_in_order) {
     const std::string stdin5 = hex_packet(5, torvad::packet_stdin, 0, "abc");
     const std::string stdin6 = hex_packet(6, torvad::packet_stdin, 1, "x");

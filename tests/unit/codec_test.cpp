@@ -3,6 +3,7 @@
 
 #include "ipc/packet.hpp"
 #include "ipc/strings.hpp"
+#include "tests/packet_hex.hpp"
 
 using namespace torvad;
 
@@ -65,14 +66,9 @@ TEST(codec, packets_match_their_bytes) {
     };
     for (const auto& r : rows) {
         auto framed = encode_packet(r.channel, r.type, r.flags, r.payload.data(), r.payload.size());
-        std::string hex, expected = r.hex;
+        std::string expected = r.hex;
         std::erase(expected, ' ');
-        char digits[3];
-        for (char byte : framed) {
-            std::snprintf(digits, sizeof digits, "%02x", static_cast<unsigned char>(byte));
-            hex += digits;
-        }
-        EXPECT_EQ(hex, expected);
+        EXPECT_EQ(hex_packet(r.channel, r.type, r.flags, r.payload), expected);
         packet_header header = read_packet_header(framed.data());
         EXPECT_EQ(header.length, framed.size());
         EXPECT_EQ(header.channel, r.channel);
