@@ -88,20 +88,9 @@ void notify_service_manager(const char* state) {
 } // namespace
 
 void report_service_state(service_state state) {
-    switch (state) {
-    case service_state::start_pending:
-        notify_service_manager("STATUS=starting");
-        break;
-    case service_state::running:
-        notify_service_manager("READY=1");
-        break;
-    case service_state::stop_pending:
-        notify_service_manager("STOPPING=1");
-        break;
-    case service_state::stopped:
-        notify_service_manager("STATUS=stopped");
-        break;
-    }
+    static const char* const messages[] = {"STATUS=starting", "READY=1", "STOPPING=1",
+                                           "STATUS=stopped"};
+    notify_service_manager(messages[static_cast<int>(state)]);
 }
 
 } // namespace torvad::platform
