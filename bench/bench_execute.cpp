@@ -66,17 +66,9 @@ int run_peer(const std::string& results, int argc, char** argv) {
 int main(int argc, char** argv) {
     if (argc == 4 && std::strcmp(argv[1], "peer") == 0)
         return run_peer(argv[2], argc, argv);
-    const char* torvad = argc > 1 ? argv[1] : "./build/torvad";
-    scratch_directory scratch("bench-execute");
-    if (!scratch.made() || access(torvad, X_OK) != 0) {
-        std::fprintf(stderr, "usage: %s [path of torvad]\n", argv[0]);
-        return 1;
-    }
-    std::string results = scratch.file("results");
-    bool ended = run_under_torvad(torvad, "peer", results, run_limit_s);
-    auto samples = read_results(results);
+    auto samples = measure_under_torvad(argc, argv, "peer", run_limit_s);
     auto &supervised = samples["torvad"], &bare = samples["bare"];
-    if (!ended || supervised.size() != requests || bare.size() != requests) {
+    if (supervised.size() != requests || bare.size() != requests) {
         std::fprintf(stderr, "incomplete run: %zu requests through torvad, %zu bare spawns\n",
                      supervised.size(), bare.size());
         return 1;

@@ -24,7 +24,7 @@ constexpr int run_limit_s = 300;
 // Each piped channel holds some seven descriptors in torvad: pipe ends and a pidfd.
 constexpr rlim_t descriptors_wanted = 16384;
 
-using figures = std::map<std::string, std::vector<double>>;
+using figures = samples;
 
 // Opens channels [from, to), each a cat on pipes that runs until its stdin
 // closes; true once all are open.
@@ -141,18 +141,10 @@ int main(int argc, char** argv) {
         return run_channels_peer(argv[2], argc, argv);
     if (argc == 4 && std::strcmp(argv[1], "relay-peer") == 0)
         return run_relay_peer(argv[2], argc, argv);
-    const char* torvad = argc > 1 ? argv[1] : "./build/torvad";
-    scratch_directory scratch("bench-memory");
-    if (!scratch.made() || access(torvad, X_OK) != 0) {
-        std::fprintf(stderr, "usage: %s [path of torvad]\n", argv[0]);
-        return 1;
-    }
     raise_descriptor_limit();
-    std::string channels_file = scratch.file("channels"), relay_file = scratch.file("relay");
-    bool ended = run_under_torvad(torvad, "channels-peer", channels_file, run_limit_s) &&
-                 run_under_torvad(torvad, "relay-peer", relay_file, run_limit_s);
-    figures channels = read_results(channels_file), relay = read_results(relay_file);
-    if (!ended || !complete(channels, 1 + std::size(channel_counts)) || !complete(relay, 2)) {
+    figures channels = measure_under_torvad(argc, argv, "channels-peer", run_limit_s);
+    figures relay = measure_under_torvad(argc, argv, "relay-peer", run_limit_s);
+    if (!complete(channels, 1 + std::size(channel_counts)) || !complete(relay, 2)) {
         std::fprintf(stderr, "incomplete run: %zu channel figures, %zu relay figures\n",
                      channels.size(), relay.size());
         return 1;

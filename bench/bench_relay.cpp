@@ -157,17 +157,9 @@ int main(int argc, char** argv) {
         return run_writer();
     if (argc == 4 && std::strcmp(argv[1], "peer") == 0)
         return run_peer(argv[2], argc, argv);
-    const char* torvad = argc > 1 ? argv[1] : "./build/torvad";
-    scratch_directory scratch("bench-relay");
-    if (!scratch.made() || access(torvad, X_OK) != 0) {
-        std::fprintf(stderr, "usage: %s [path of torvad]\n", argv[0]);
-        return 1;
-    }
-    std::string results = scratch.file("results");
-    bool ended = run_under_torvad(torvad, "peer", results, run_limit_s);
-    auto rates = read_results(results);
+    auto rates = measure_under_torvad(argc, argv, "peer", run_limit_s);
     auto &supervised = rates["torvad"], &bare = rates["bare"];
-    if (!ended || supervised.size() != rounds || bare.size() != rounds) {
+    if (supervised.size() != rounds || bare.size() != rounds) {
         std::fprintf(stderr, "incomplete run: %zu rounds through torvad, %zu bare\n",
                      supervised.size(), bare.size());
         return 1;

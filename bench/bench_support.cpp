@@ -108,7 +108,7 @@ bool run_under_torvad(const char* torvad, const char* mode, const std::string& r
     return clean;
 }
 
-std::map<std::string, std::vector<double>> read_results(const std::string& path) {
+samples read_results(const std::string& path) {
     std::map<std::string, std::vector<double>> values;
     std::ifstream file(path);
     std::string key;
@@ -246,6 +246,19 @@ long status_kib(pid_t pid, const char* field) {
         if (word == name && status >> kib)
             break;
     return kib;
+}
+
+samples measure_under_torvad(int argc, char** argv, const char* mode, int limit_s) {
+    const char* torvad = argc > 1 ? argv[1] : "./build/torvad";
+    scratch_directory scratch("bench");
+    if (!scratch.made() || access(torvad, X_OK) != 0) {
+        std::fprintf(stderr, "usage: %s [path of torvad]\n", argv[0]);
+        return {};
+    }
+    std::string results = scratch.file(mode);
+    if (!run_under_torvad(torvad, mode, results, limit_s))
+        return {};
+    return read_results(results);
 }
 
 } // namespace bench

@@ -45,7 +45,12 @@ bool run_under_torvad(const char* torvad, const char* mode, const std::string& r
                       int limit_s);
 
 // "key value" lines of a results file, the values of each key in file order.
-std::map<std::string, std::vector<double>> read_results(const std::string& path);
+using samples = std::map<std::string, std::vector<double>>;
+samples read_results(const std::string& path);
+
+// Runs mode under the torvad named by argv[1] (else ./build/torvad) and reads
+// its results back; empty when the run failed, which has been reported.
+samples measure_under_torvad(int argc, char** argv, const char* mode, int limit_s);
 
 struct packet_view {
     torvad::packet_header header;
