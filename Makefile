@@ -40,12 +40,16 @@ build-fuzz/build.ninja:
 	CXX=clang++ cmake -S . -B build-fuzz -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
 	  -DTORVAD_FUZZ=ON -DTORVAD_SANITIZE=ON
 
+# An input of fuzz_regex is a pattern, a newline and a text, 64 bytes each at most.
 fuzz: deps build-fuzz/build.ninja
-	cmake --build build-fuzz --target fuzz_framing
-	mkdir -p build-fuzz/corpus
+	cmake --build build-fuzz --target fuzz_framing fuzz_regex
+	mkdir -p build-fuzz/corpus build-fuzz/corpus_regex
 	./build-fuzz/fuzz/fuzz_framing -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
 	  -artifact_prefix=build-fuzz/ \
 	  build-fuzz/corpus fuzz/seeds
+	./build-fuzz/fuzz/fuzz_regex -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	  -max_len=129 -artifact_prefix=build-fuzz/regex- \
+	  build-fuzz/corpus_regex fuzz/seeds_regex
 
 bench: build
 	./build/bench/bench_framing

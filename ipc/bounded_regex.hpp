@@ -1,0 +1,39 @@
+// One execution pattern line, matched within a fixed bound on time and stack:
+// the text it is matched against is chosen by an untrusted child.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace torvad {
+
+namespace regex {
+struct automaton;
+}
+
+enum class match_verdict { match, no_match, undecided };
+
+// One pattern line, compiled once at load. Copies share the compiled form.
+class bounded_regex {
+  public:
+    // Compiles source as ECMAScript (case-sensitive, no other flag); nullopt and a short
+    // reason in error when it is not a valid expression (or too large to compile).
+    static std::optional<bounded_regex> compile(std::string_view source, std::string& error);
+
+    // Whole-text match, the same answer std::regex_match(text, std::regex(source,
+    // std::regex::ECMAScript)) gives whenever that finishes; undecided when no answer can be
+    // had within this matcher's bounds on time and stack.
+    match_verdict match(std::string_view text) const;
+
+  private:
+    explicit bounded_regex(std::shared_ptr<const regex::automaton> compiled);
+
+    std::shared_ptr<const regex::automaton> compiled_;
+};
+
+// The bound on one call of match, in milliseconds of the calling thread's CPU time.
+constexpr int regex_time_bound_ms = 25;
+
+} // namespace torvad
