@@ -53,15 +53,16 @@ build-fuzz/build.ninja:
 	CXX=clang++ cmake -S . -B build-fuzz -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
 	  -DTORVAD_FUZZ=ON -DTORVAD_SANITIZE=ON
 
-# Each target for FUZZ_SECONDS, from its committed seeds and the corpus it grew before.
-FUZZ_TARGETS := framing execute
+# Each target for FUZZ_SECONDS, from its committed seeds and the corpus it grew
+# before. An input of fuzz_regex is a pattern, a newline and a text, 64 bytes each.
+FUZZ_TARGETS := framing execute regex
+FUZZ_FLAGS_regex := -max_len=129
 fuzz: deps build-fuzz/build.ninja
 	cmake --build build-fuzz --target $(addprefix fuzz_,$(FUZZ_TARGETS))
-	for target in $(FUZZ_TARGETS); do \
-	  mkdir -p build-fuzz/corpus_$$target && \
-	  ./build-fuzz/fuzz/fuzz_$$target -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
-	    -artifact_prefix=build-fuzz/ build-fuzz/corpus_$$target fuzz/seeds_$$target || exit 1; \
-	done
+	$(foreach target,$(FUZZ_TARGETS),mkdir -p build-fuzz/corpus_$(target) && \
+	  ./build-fuzz/fuzz/fuzz_$(target) -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	    $(FUZZ_FLAGS_$(target)) -artifact_prefix=build-fuzz/$(target)- \
+	    build-fuzz/corpus_$(target) fuzz/seeds_$(target) && ) true
 
 bench: build
 	./build/bench/bench_framing

@@ -34,7 +34,14 @@ void daemon::load_patterns(const char* path) {
     std::string text;
     platform::os_error error = platform::read_file(path, text);
     std::vector<std::string> problems;
-    patterns_ = parse_patterns(text, path, problems);
+    // The expression compiler recurses as deep as a line is long: it gets a
+    // stack of that size, and a file that can't have one loads as closed.
+    bool parsed = platform::run_on_large_stack(
+        patterns_stack_bytes(text), [&] { patterns_ = parse_patterns(text, path, problems); });
+    if (!parsed) {
+        patterns_ = parse_patterns({}, path, problems);
+        problems.push_back("no stack to compile the patterns of '" + std::string(path) + "'");
+    }
     // An unreadable file leaves the lists empty: closed, not open.
     if (error) {
         log_error("failed to open patterns file '%s'", path);

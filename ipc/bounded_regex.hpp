@@ -1,26 +1,43 @@
-// A pattern line compiled once, matched against child-chosen text with a
-// bound on time and stack.
+// One execution pattern line, matched within a fixed bound on time and stack:
+// the text it is matched against is chosen by an untrusted child.
 #pragma once
 
 #include <memory>
 #include <optional>
-#include <regex>
 #include <string>
 #include <string_view>
 
 namespace torvad {
 
+namespace regex {
+struct automaton;
+}
+
 enum class match_verdict { match, no_match, undecided };
 
+// One pattern line, compiled once at load. Copies share the compiled form.
 class bounded_regex {
   public:
+    // Compiles source as ECMAScript (case-sensitive, no other flag); nullopt and a short
+    // reason in error when it is not a valid expression (or too large to compile).
+    // The compiler recurses as deep as the line: it needs compile_stack_bytes(source).
     static std::optional<bounded_regex> compile(std::string_view source, std::string& error);
+
+    // Whole-text match, the same answer std::regex_match(text, std::regex(source,
+    // std::regex::ECMAScript)) gives whenever that finishes; undecided when no answer can be
+    // had within this matcher's bounds on time and stack.
     match_verdict match(std::string_view text) const;
 
   private:
-    std::shared_ptr<const std::regex> expression_;
+    explicit bounded_regex(std::shared_ptr<const regex::automaton> compiled);
+
+    std::shared_ptr<const regex::automaton> compiled_;
 };
 
-constexpr int regex_time_bound_ms = 50;
+// The stack the compiler may need for source, however the line is made.
+std::size_t compile_stack_bytes(std::string_view source);
+
+// The bound on one call of match, in milliseconds of the calling thread's CPU time.
+constexpr int regex_time_bound_ms = 25;
 
 } // namespace torvad

@@ -1,6 +1,8 @@
 // The patterns file's lines and the permission decision over them.
 #include "ipc/patterns.hpp"
 
+#include <algorithm>
+
 #include "ipc/strings.hpp"
 
 namespace torvad {
@@ -55,6 +57,16 @@ pattern_lists parse_patterns(std::string_view text, std::string_view file_name,
         text.remove_prefix(end == std::string_view::npos ? text.size() : end + 1);
     }
     return lists;
+}
+
+std::size_t patterns_stack_bytes(std::string_view text) {
+    std::size_t most = compile_stack_bytes({});
+    while (!text.empty()) {
+        std::size_t end = std::min(text.find('\n'), text.size());
+        most = std::max(most, compile_stack_bytes(text.substr(0, end)));
+        text.remove_prefix(std::min(end + 1, text.size()));
+    }
+    return most;
 }
 
 permission decide_permission(const pattern_lists& patterns, const std::string& requester_user,

@@ -23,6 +23,9 @@ struct pattern_lists {
 pattern_lists parse_patterns(std::string_view text, std::string_view file_name,
                              std::vector<std::string>& problems);
 
+// The stack parse_patterns may need for text: as much as its deepest line.
+std::size_t patterns_stack_bytes(std::string_view text);
+
 // The decision for one request: refusal is null when permitted, else the
 // text to log. undecided: a pattern could not be matched within its bounds,
 // and the request is refused for that alone.

@@ -47,6 +47,10 @@ std::string search_path(const std::string& name);
 // The whole content of a file.
 os_error read_file(const std::string& path, std::string& content);
 
+// Runs work on a thread with a stack of stack_bytes and waits for it; what
+// work throws is thrown here. False when no such thread could be had.
+bool run_on_large_stack(std::size_t stack_bytes, const std::function<void()>& work);
+
 // --- the event log --------------------------------------------------------------
 
 enum class event_type : std::uint16_t { error = 1, warning = 2, information = 4 };

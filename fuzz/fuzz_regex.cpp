@@ -1,0 +1,110 @@
+// The bounded matcher against std::regex_match on short patterns and texts.
+// An input is the pattern, a newline, then the text; each is cut to 64 bytes.
+#include <cstdint>
+#include <optional>
+#include <regex>
+#include <string>
+
+#include "ipc/bounded_regex.hpp"
+
+using torvad::bounded_regex;
+using torvad::match_verdict;
+
+namespace {
+
+constexpr std::size_t max_pattern = 64;
+constexpr std::size_t max_text = 64;
+
+// The library's matcher takes exponential time on some of these inputs, so
+// its answer is asked for only when it comes quickly: this iterator counts
+// the matcher's steps and gives up after a fixed number of them.
+struct too_slow {};
+long steps_left;
+
+void step() {
+    if (--steps_left < 0)
+        throw too_slow{};
+}
+
+class counting_iterator {
+  public:
+    using iterator_category = std::bidirectional_iterator_tag;
+    using value_type = char;
+    using difference_type = std::ptrdiff_t;
+    using pointer = const char*;
+    using reference = const char&;
+
+    counting_iterator() { step(); }
+    explicit counting_iterator(const char* at) : at_(at) {}
+    counting_iterator(const counting_iterator& other) : at_(other.at_) { step(); }
+    counting_iterator& operator=(const counting_iterator& other) {
+        step();
+        at_ = other.at_;
+        return *this;
+    }
+    reference operator*() const { return step(), *at_; }
+    counting_iterator& operator++() { return step(), ++at_, *this; }
+    counting_iterator& operator--() { return step(), --at_, *this; }
+    counting_iterator operator++(int) { return step(), counting_iterator(at_++); }
+    counting_iterator operator--(int) { return step(), counting_iterator(at_--); }
+    bool operator==(const counting_iterator& other) const { return step(), at_ == other.at_; }
+
+  private:
+    const char* at_ = nullptr;
+};
+
+bool library_is_quick(const std::regex& expression, const std::string& text) {
+    steps_left = 1'000'000;
+    try {
+        const char* begin = text.data();
+        std::regex_match(counting_iterator(begin), counting_iterator(begin + text.size()),
+                         expression);
+        return true;
+    } catch (const too_slow&) {
+        return false;
+    }
+}
+
+// Only counted repeats, lookaheads and back-references make the work grow
+// beyond text length times pattern length; without them, even in a sanitizer
+// build, the bound is never near, and undecided is a fault.
+bool must_decide(const std::string& pattern) {
+    if (pattern.find('{') != std::string::npos || pattern.find("(?") != std::string::npos)
+        return false;
+    for (std::size_t i = 0; i + 1 < pattern.size(); ++i)
+        if (pattern[i] == '\\' && pattern[i + 1] >= '1' && pattern[i + 1] <= '9')
+            return false;
+    return true;
+}
+
+} // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
+    std::string input(reinterpret_cast<const char*>(data), size);
+    std::size_t cut = input.find('\n');
+    std::string pattern = input.substr(0, std::min(cut, max_pattern));
+    std::string text = cut == std::string::npos ? "" : input.substr(cut + 1, max_text);
+
+    std::string error;
+    std::optional<bounded_regex> bounded = bounded_regex::compile(pattern, error);
+    std::optional<std::regex> library;
+    try {
+        library.emplace(pattern, std::regex::ECMAScript);
+    } catch (const std::regex_error&) {
+    }
+    if (bounded.has_value() != library.has_value())
+        __builtin_trap();
+    if (!bounded)
+        return 0;
+
+    match_verdict verdict = bounded->match(text);
+    if (verdict == match_verdict::undecided) {
+        if (must_decide(pattern))
+            __builtin_trap();
+        return 0;
+    }
+    if (library_is_quick(*library, text) &&
+        (verdict == match_verdict::match) != std::regex_match(text, *library))
+        __builtin_trap();
+    return 0;
+}
