@@ -21,8 +21,7 @@ std::string join_strings(const std::vector<std::string>& items);
 // escape_set; every other character, a backslash too, passes unchanged.
 std::string quote_argument(std::string_view text, std::string_view escape_set);
 
-// The escape sets of the two users of quote_argument.
-constexpr std::string_view command_line_escapes = "\"";
+// The escape set of the trace: quotes and backslashes.
 constexpr std::string_view trace_escapes = "\"\\";
 
 } // namespace torvad

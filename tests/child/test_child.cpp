@@ -9,6 +9,7 @@
 #include <cstring>
 #include <dirent.h>
 #include <fcntl.h>
+#include <map>
 #include <string>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -172,8 +173,7 @@ int mode_spawn_once(const context& how) {
     if (how.args.empty() || !create_once(how.args[0]))
         return serve(how, false);
     connection link(how.ipc_fd);
-    peer::version_info version;
-    peer::read_version(link, version);
+    greet(link);
     link.execute(1, 0, {how.self, "fds"});
     link.execute(2, 0, {"sleep", "30"});
     peer::packet packet;
@@ -187,8 +187,7 @@ int mode_spawn_once(const context& how) {
 // opened first, output in order and in pieces of 4096 at most, closed last.
 int mode_relay(const context& how) {
     connection link(how.ipc_fd);
-    peer::version_info version;
-    peer::read_version(link, version);
+    greet(link);
     std::string sent(10000, 'a'), out, err;
     for (std::size_t i = 0; i < sent.size(); ++i)
         sent[i] = static_cast<char>('a' + i % 26);
@@ -240,16 +239,20 @@ int mode_execute(const context& how) {
         else if (request.size() > 1)
             link.execute(++sent, std::stoul(request[0]), {request.begin() + 1, request.end()});
     }
+    // Ends are told in channel order once all are in, whatever order they came in.
+    std::map<std::uint32_t, std::string> ends;
     peer::packet packet;
-    for (std::uint32_t ended = 0; ended < sent && link.receive(packet);) {
+    while (ends.size() < sent && link.receive(packet)) {
         const auto& h = packet.header;
         if (h.type == packet_sigterm)
             return 0;
         if (h.type == packet_stdout)
             say("%u stdout %s", h.channel, packet.payload.c_str());
         else if (h.type == packet_failed || h.type == packet_closed)
-            say("%u %s %u", h.channel, packet_type_name(h.type), h.flags), ++ended;
+            ends[h.channel] = packet_type_name(h.type) + (" " + std::to_string(h.flags));
     }
+    for (const auto& [channel, end] : ends)
+        say("%u %s", channel, end.c_str());
     return await_sigterm(link, true);
 }
 

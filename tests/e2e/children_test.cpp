@@ -88,6 +88,7 @@ TEST(children, a_channel_relays_its_standard_streams_in_order) {
 TEST(children, an_orphaned_channel_is_ended_by_force_at_the_stop) {
     scratch_dir dir;
     run_scenario(child({"spawn-once", dir.path + "/spawned"}),
-                 {"?child: spawned", "?starting 'test_child' again.", "#ready pid", "!INT",
-                  "?'sleep' exited with 0x0.", "kill 9", "=0", "+child: fds clean", "-leaked"});
+                 {"?child: spawned", "?starting 'test_child' again.", "#ready pid",
+                  "&child: fds clean", "!INT", "?'sleep' exited with 0x0.", "kill 9", "=0",
+                  "-leaked"});
 }

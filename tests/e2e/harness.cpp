@@ -131,6 +131,14 @@ bool daemon_run::wait_for(const std::string& text, int timeout_ms) {
     }
 }
 
+bool daemon_run::wait_anywhere(const std::string& text, int timeout_ms) {
+    std::size_t kept = cursor_;
+    cursor_ = 0;
+    bool found = wait_for(text, timeout_ms);
+    cursor_ = kept;
+    return found;
+}
+
 std::string daemon_run::wait_value(const std::string& key, int timeout_ms) {
     if (!wait_for(key + "=", timeout_ms))
         return {};
@@ -192,6 +200,8 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
             EXPECT_EQ(run.wait_exit(), std::atoi(text.c_str())) << run.output();
         else if (step == "Z")
             EXPECT_EQ(zombie_children(run.pid()), 0);
+        else if (step[0] == '&')
+            EXPECT_TRUE(run.wait_anywhere(text)) << "waited for: " << text << "\n" << run.output();
         else if (step[0] == '+')
             EXPECT_NE(run.output().find(text), std::string::npos) << text << "\n" << run.output();
         else if (step[0] == '-')

@@ -33,6 +33,8 @@ class daemon_run {
 
     // Reads until text appears behind the cursor; moves the cursor behind it.
     bool wait_for(const std::string& text, int timeout_ms = 10000);
+    // Reads until text appears anywhere; the cursor stays where it was.
+    bool wait_anywhere(const std::string& text, int timeout_ms = 10000);
     // The value behind "key=" in the next output that holds it, e.g. a pid.
     std::string wait_value(const std::string& key, int timeout_ms = 10000);
     // The exit code, or -1 when it didn't end in time (it is killed then).
@@ -57,6 +59,7 @@ class daemon_run {
 //   "#key"  takes the pid behind "key=" as the child "kill N" sends signal N to it
 //   "=N"    expects exit code N                     "-text" text never appears
 //   "+text" text appears anywhere                    "Z" no child of torvad is a zombie
+//   "&text" waits for text anywhere, cursor kept
 //   "!GROUP" SIGINT to torvad's process group, as a terminal's Ctrl-C
 //   "M<n>"  torvad's peak memory stayed below n MiB
 // A test's own steps, tried before those above; true when it took the step.
