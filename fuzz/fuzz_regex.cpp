@@ -87,6 +87,10 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
 
     std::string error;
     std::optional<bounded_regex> bounded = bounded_regex::compile(pattern, error);
+    // Refused before the library sees it: the library's own reading of such a
+    // number overflows, which the sanitizer would report as ours.
+    if (!bounded && error.find("number is too large") != std::string::npos)
+        return 0;
     std::optional<std::regex> library;
     try {
         library.emplace(pattern, std::regex::ECMAScript);

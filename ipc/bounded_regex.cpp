@@ -38,7 +38,8 @@ bool has_oversized_number(std::string_view source) {
     };
     for (std::size_t i = 0; i < source.size(); ++i) {
         if (source[i] == '\\') {
-            if (digits_at(i + 1) > most_digits)
+            // \0 is a NUL and the digits behind it plain text; \1 on is a reference.
+            if (i + 1 < source.size() && source[i + 1] != '0' && digits_at(i + 1) > most_digits)
                 return true;
             ++i; // the escaped character is not syntax
         } else if (source[i] == '{') {

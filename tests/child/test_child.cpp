@@ -108,6 +108,8 @@ std::string descriptor_report(int ipc_fd) {
 
 int mode_fds(const context& how) {
     say("fds %s", descriptor_report(how.ipc_fd).c_str());
+    if (std::getenv("NOTIFY_SOCKET") != nullptr)
+        say("notify socket inherited");
     sigset_t mask;
     sigprocmask(SIG_SETMASK, nullptr, &mask);
     std::string ignored;

@@ -70,11 +70,12 @@ TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
         std::vector<std::string> args, steps;
     };
     const row rows[] = {
-        // a stray SIGUSR2 changes nothing; a SIGTERM after the end can't kill us
-        {child({"peer"}),
+        // a stray SIGUSR2 changes nothing; a SIGTERM after the end can't kill
+        // us; the manager's socket is ours, not the child's
+        {child({"fds"}),
          {"@STATUS=starting", "@READY=1", "?successfully started", "?child: ready", "!USR2",
           "!TERM", "@STOPPING=1", "?child: sigterm", "?'test_child' exited with 0x0.",
-          "@STATUS=stopped", "!TERM", "=0", "-\x1b"}},
+          "@STATUS=stopped", "!TERM", "=0", "-\x1b", "+child: fds clean", "-notify socket"}},
         // a stop during the start: the first run returns at once, the second
         // still ends the child through its sigterm
         {child({"peer"}),
