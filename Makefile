@@ -48,7 +48,7 @@ fuzz: deps build-fuzz/build.ninja
 	  -artifact_prefix=build-fuzz/ \
 	  build-fuzz/corpus fuzz/seeds
 	./build-fuzz/fuzz/fuzz_regex -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
-	  -max_len=129 -artifact_prefix=build-fuzz/regex- \
+	  -max_len=129 -dict=fuzz/regex.dict -artifact_prefix=build-fuzz/regex- \
 	  build-fuzz/corpus_regex fuzz/seeds_regex
 
 bench: build

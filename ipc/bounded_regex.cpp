@@ -44,6 +44,10 @@ bounded_regex::bounded_regex(std::shared_ptr<const regex::automaton> compiled)
     : compiled_(std::move(compiled)) {}
 
 std::optional<bounded_regex> bounded_regex::compile(std::string_view source, std::string& error) {
+    if (regex::has_oversized_number(source)) {
+        error = "a repeat count or back-reference number is too large";
+        return std::nullopt;
+    }
     std::shared_ptr<const regex::automaton> compiled;
     try {
         auto work = [&] {
