@@ -62,6 +62,8 @@ std::optional<bounded_regex> bounded_regex::compile(std::string_view source, std
         error = "too large to compile (out of memory)";
     } catch (const std::exception& failure) {
         error = failure.what();
+    } catch (...) {
+        error = "cannot be compiled";
     }
     return std::nullopt;
 }
