@@ -26,32 +26,6 @@ constexpr std::size_t compile_stack_per_term = 1024;
 constexpr std::size_t compile_stack_per_parenthesis = 4096;
 constexpr std::size_t max_terms = 100000;
 
-// The library reads a count or a back-reference number into a long without a
-// check, so a long run of digits overflows it: such a line is refused first.
-bool has_oversized_number(std::string_view source) {
-    constexpr std::size_t most_digits = 9;
-    auto digits_at = [&](std::size_t from) {
-        std::size_t end = from;
-        while (end < source.size() && source[end] >= '0' && source[end] <= '9')
-            ++end;
-        return end - from;
-    };
-    for (std::size_t i = 0; i < source.size(); ++i) {
-        if (source[i] == '\\') {
-            // \0 is a NUL and the digits behind it plain text; \1 on is a reference.
-            if (i + 1 < source.size() && source[i + 1] != '0' && digits_at(i + 1) > most_digits)
-                return true;
-            ++i; // the escaped character is not syntax
-        } else if (source[i] == '{') {
-            std::size_t low = digits_at(i + 1);
-            bool comma = i + 1 + low < source.size() && source[i + 1 + low] == ',';
-            if (low > most_digits || (comma && digits_at(i + 2 + low) > most_digits))
-                return true;
-        }
-    }
-    return false;
-}
-
 std::string compile_error(const std::regex_error& failure) {
     if (failure.code() == std::regex_constants::error_space)
         return "too large to compile (more than 100000 automaton states)";
@@ -70,8 +44,8 @@ bounded_regex::bounded_regex(std::shared_ptr<const regex::automaton> compiled)
     : compiled_(std::move(compiled)) {}
 
 std::optional<bounded_regex> bounded_regex::compile(std::string_view source, std::string& error) {
-    if (has_oversized_number(source)) {
-        error = "a count or back-reference number is too large";
+    if (regex::has_oversized_number(source)) {
+        error = "a repeat count or back-reference number is too large";
         return std::nullopt;
     }
     try {
@@ -82,6 +56,8 @@ std::optional<bounded_regex> bounded_regex::compile(std::string_view source, std
         error = "too large to compile (out of memory)";
     } catch (const std::exception& failure) {
         error = failure.what();
+    } catch (...) {
+        error = "cannot be compiled";
     }
     return std::nullopt;
 }

@@ -107,6 +107,19 @@ std::bitset<256> word_characters(const library_traits& traits) {
 
 } // namespace
 
+bool has_oversized_number(std::string_view source) {
+    constexpr std::size_t safe_digits = 18;
+    std::size_t digits = 0;
+    for (std::size_t i = 0; i < source.size(); ++i) {
+        digits = source[i] >= '0' && source[i] <= '9' ? digits + 1 : 0;
+        // Digits behind a backslash, a brace or a comma may be read as a number.
+        if (digits > safe_digits && i >= digits &&
+            std::string_view("\\{,").find(source[i - digits]) != std::string_view::npos)
+            return true;
+    }
+    return false;
+}
+
 automaton compile_automaton(std::string_view source) {
     // The same compiler, locale and flag as std::regex(source, std::regex::ECMAScript).
     static const char empty[] = "";

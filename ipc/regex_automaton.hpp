@@ -43,9 +43,15 @@ struct automaton {
     bool has_backrefs = false;
 };
 
+// The library's compiler reads the number of a back-reference or a repeat
+// count into a long without a check: nineteen digits may overflow it, which is
+// undefined behaviour. True when source has such a number, or looks to have.
+bool has_oversized_number(std::string_view source);
+
 // Compiles source as ECMAScript with the standard library's own compiler, so
-// exactly what std::regex accepts is accepted; throws std::regex_error. That
-// compiler recurses per nesting level and per term: run it on a large stack.
+// exactly what std::regex accepts is accepted; throws std::regex_error. Not for
+// a source with an oversized number. That compiler recurses per nesting level
+// and per term: run it on a large stack.
 automaton compile_automaton(std::string_view source);
 
 // \b as the library decides it: the character before counts only when the

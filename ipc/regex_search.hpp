@@ -52,7 +52,8 @@ constexpr unsigned max_lookahead_depth = 32;
 
 // Keeps the set of live states per text position: each state is visited at
 // most once per position, so the work is at most text length times automaton
-// size. Only for automata without back-references. Throws out_of_budget.
+// size, and as much again for each lookahead searched. Only for automata
+// without back-references. Throws out_of_budget.
 bool match_by_state_sets(const automaton& compiled, std::string_view text, budget& meter);
 
 // Backtracks in the order of the standard library's own search, which decides

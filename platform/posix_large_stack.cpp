@@ -2,6 +2,7 @@
 // its pages touched as deep as the work goes.
 #include "platform/platform.hpp"
 
+#include <csignal>
 #include <exception>
 #include <pthread.h>
 
@@ -31,9 +32,15 @@ bool run_on_large_stack(std::size_t stack_bytes, const std::function<void()>& wo
     if (pthread_attr_init(&attributes) != 0)
         return false;
     task job{work, nullptr};
+    // The thread starts with every signal blocked, so signals stay with the
+    // threads that expect them.
+    sigset_t all, kept;
+    sigfillset(&all);
+    pthread_sigmask(SIG_SETMASK, &all, &kept);
     pthread_t thread;
     bool started = pthread_attr_setstacksize(&attributes, stack_bytes) == 0 &&
                    pthread_create(&thread, &attributes, run_task, &job) == 0;
+    pthread_sigmask(SIG_SETMASK, &kept, nullptr);
     pthread_attr_destroy(&attributes);
     if (!started)
         return false;
