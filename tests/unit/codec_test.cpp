@@ -74,13 +74,3 @@ TEST(codec, packets_match_their_bytes) {
     EXPECT_STREQ(packet_type_name(packet_sigterm), "sigterm");
     EXPECT_STREQ(packet_type_name(9), "unknown");
 }
-
-TEST(codec, version_payload_has_three_items_and_no_trailing_nul) {
-    std::string payload = version_payload("torvad.exe", "1.1.21.0", true);
-    EXPECT_EQ(payload, std::string("torvad.exe\0"
-                                   "1.1.21.0\0Background:true",
-                                   35));
-    EXPECT_EQ(version_payload("", "1.1.21.0", false), std::string("\0"
-                                                                  "1.1.21.0\0Background:false",
-                                                                  26));
-}
