@@ -76,6 +76,8 @@ struct scratch_dir {
 
 bool file_exists(const std::string& path);
 std::string read_file(const std::string& path);
+// A datagram socket bound at path, as a service manager or a log daemon has.
+int bound_datagram_socket(const std::string& path);
 // The peak resident memory of pid, in KiB.
 long peak_memory_kib(pid_t pid);
 // Children of pid that are zombies.

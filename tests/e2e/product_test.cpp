@@ -8,7 +8,6 @@
 #include <fstream>
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include "tests/e2e/harness.hpp"
@@ -16,16 +15,6 @@
 using namespace e2e;
 
 namespace {
-
-int bound_datagram_socket(const std::string& path) {
-    int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    path.copy(address.sun_path, sizeof address.sun_path - 1);
-    if (bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == -1)
-        ADD_FAILURE() << "bind " << path;
-    return fd;
-}
 
 // The service manager's end: a datagram socket that torvad reports its states to.
 class notify_socket {

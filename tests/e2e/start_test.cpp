@@ -3,13 +3,11 @@
 #include <gtest/gtest.h>
 
 #include <csignal>
-#include <cstring>
 #include <fcntl.h>
 #include <sched.h>
 #include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -101,12 +99,7 @@ std::string syslog_records(const std::vector<std::string>& args) {
             _exit(2);
         if (mount(dev.path.c_str(), "/dev", nullptr, MS_BIND | MS_REC, nullptr) == -1)
             _exit(2);
-        int log = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-        sockaddr_un address{};
-        address.sun_family = AF_UNIX;
-        std::strcpy(address.sun_path, "/dev/log");
-        if (bind(log, reinterpret_cast<sockaddr*>(&address), sizeof address) == -1)
-            _exit(3);
+        int log = bound_datagram_socket("/dev/log");
         {
             daemon_run run(args);
             run.wait_exit();
