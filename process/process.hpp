@@ -92,6 +92,7 @@ class process : public std::enable_shared_from_this<process> {
 
     // relayed standard streams (process/streams.cpp)
     void wait_output(int stream);
+    boost::system::error_code forward_output(int stream, process* requester);
     void relay_output(int stream);
     void drain_output();
     void resume_output();

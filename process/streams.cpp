@@ -26,10 +26,25 @@ void process::wait_output(int stream) {
                     });
 }
 
+// One read of stream, as one packet to the requester (dropped without one).
+// A stream that ends or fails is closed; would_block leaves it open.
+boost::system::error_code process::forward_output(int stream, process* requester) {
+    descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
+    boost::system::error_code error;
+    std::size_t bytes = pipe.read_some(boost::asio::buffer(relay_buffer), error);
+    if (error && error != boost::asio::error::would_block) {
+        boost::system::error_code ignored;
+        pipe.close(ignored);
+    } else if (!error && requester) {
+        requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0, relay_buffer,
+                               static_cast<std::uint32_t>(bytes));
+    }
+    return error;
+}
+
 // Reads what is ready, a few reads per wake so that one busy channel doesn't
 // starve the others, and stops while the requester's queue is full.
 void process::relay_output(int stream) {
-    descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
     auto requester = parent.lock();
     for (int reads = 0; reads < relay_reads_per_wake; ++reads) {
         if (requester && requester->ipc_backlogged()) {
@@ -37,18 +52,11 @@ void process::relay_output(int stream) {
             requester->wait_for_room(shared_from_this());
             return;
         }
-        boost::system::error_code error;
-        std::size_t bytes = pipe.read_some(boost::asio::buffer(relay_buffer), error);
+        boost::system::error_code error = forward_output(stream, requester.get());
         if (error == boost::asio::error::would_block)
             break;
-        if (error) {
-            // End of file, or the pipe is gone: this stream is over.
-            pipe.close(error);
-            return;
-        }
-        if (requester)
-            requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0, relay_buffer,
-                                   static_cast<std::uint32_t>(bytes));
+        if (error)
+            return; // end of file, or the pipe is gone: this stream is over
     }
     wait_output(stream);
 }
@@ -62,20 +70,13 @@ void process::resume_output() {
     }
 }
 
+// The child is gone, so what is in its pipes is all there will be from it;
+// the queue's mark doesn't hold this back, the pipes' size bounds it.
 void process::drain_output() {
     auto requester = parent.lock();
     for (int stream : {1, 2}) {
         descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
-        boost::system::error_code error;
-        // The child is gone, so what is in the pipe is all there will be from
-        // it; the queue's mark doesn't hold this back, the pipe's size bounds it.
-        while (pipe.is_open()) {
-            std::size_t bytes = pipe.read_some(boost::asio::buffer(relay_buffer), error);
-            if (error)
-                break;
-            if (requester)
-                requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0, relay_buffer,
-                                       static_cast<std::uint32_t>(bytes));
+        while (pipe.is_open() && !forward_output(stream, requester.get())) {
         }
         output_paused[stream] = false;
     }
