@@ -5,6 +5,8 @@
 #include <csignal>
 #include <exception>
 
+#include <boost/asio/post.hpp>
+
 #include "process/process.hpp"
 
 namespace torvad {
@@ -15,7 +17,8 @@ bool background = false;
 bool auto_restart = true;
 const char* const daemon_version = "1.1.21.0";
 
-daemon::daemon() : colour_(platform::stdout_is_terminal()), signals_(*this, SIGINT) {}
+daemon::daemon()
+    : colour_(platform::stdout_is_terminal()), signals_(*this, SIGINT), orphan_watch_(*this) {}
 
 daemon::~daemon() {
     // Children go first, while the loop's services still exist for the
@@ -109,6 +112,25 @@ bool daemon::any_persistent() const {
     return false;
 }
 
+std::size_t daemon::persistent_count() const {
+    std::size_t count = 0;
+    for (const auto& child : children_)
+        count += child->persistent;
+    return count;
+}
+
+// One report per turn of the loop at most: a restart adds the successor and
+// removes its predecessor in one turn, which changes nothing worth telling.
+void daemon::persistent_children_changed() {
+    if (children_report_posted_)
+        return;
+    children_report_posted_ = true;
+    boost::asio::post(*this, [this] {
+        children_report_posted_ = false;
+        platform::report_service_children(persistent_count());
+    });
+}
+
 void daemon::run() {
     // Handlers report failures by result, not by exception; what can still
     // come out of one is an allocation that failed. The loop logs it and goes
@@ -124,6 +146,8 @@ void daemon::run() {
 }
 
 void daemon::adopt(std::shared_ptr<process> child) {
+    if (child->persistent)
+        persistent_children_changed();
     children_.insert(std::move(child));
 }
 
@@ -132,6 +156,8 @@ void daemon::remove(const std::shared_ptr<process>& child) {
         if (member->parent.lock() == child)
             member->close_pipes();
     children_.erase(child);
+    if (child->persistent)
+        persistent_children_changed();
     if (!any_persistent())
         io_context::stop();
 }

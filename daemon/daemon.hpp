@@ -9,6 +9,7 @@
 #include <unordered_set>
 
 #include <boost/asio/io_context.hpp>
+#include <boost/asio/posix/stream_descriptor.hpp>
 #include <boost/asio/signal_set.hpp>
 
 #include "ipc/patterns.hpp"
@@ -57,6 +58,10 @@ class daemon : public boost::asio::io_context {
     // in the same way.
     void run();
     bool any_persistent() const;
+    // Reaps, from now on, the orphaned descendants the kernel hands us, never
+    // a child we supervise. Called before any thread is started. (daemon/orphans.cpp)
+    void take_orphans();
+    std::size_t persistent_count() const;
 
     // What a process needs of its owner.
     void adopt(std::shared_ptr<process> child);
@@ -72,13 +77,18 @@ class daemon : public boost::asio::io_context {
     void terminate_children();
     void arm_signal_wait();
     void on_signal(const boost::system::error_code& error, int signal_number);
+    void persistent_children_changed();
+    void wait_for_orphans();
+    void reap_orphans();
 
     bool colour_;
     std::string service_name_;
     std::string program_name_;
     std::unordered_set<std::shared_ptr<process>> children_;
     boost::asio::signal_set signals_;
+    boost::asio::posix::stream_descriptor orphan_watch_;
     pattern_lists patterns_;
+    bool children_report_posted_ = false;
 };
 
 // The supervisor of this program, built before main and gone after it.

@@ -79,6 +79,8 @@ int main(int argc, char** argv) {
     logging = options.logging;
     background = background || options.background;
     auto_restart = !options.no_restart;
+    // Before the start runs any program or thread: see daemon/orphans.cpp.
+    the_daemon.take_orphans();
 
     std::string pid_file = write_pid_file(options.pid_file);
     platform::os_error ignored;

@@ -18,10 +18,11 @@ bool first_run_over = false;
 
 void run_service() {
     using platform::service_state;
-    platform::report_service_state(service_state::start_pending);
+    platform::report_service_state(service_state::start_pending, 0);
     the_daemon.start();
-    // Running holds whatever the start did; a failed start shows in the log.
-    platform::report_service_state(service_state::running);
+    // Running holds whatever the start did; a failed start shows in the log
+    // and in the number of children the status names.
+    platform::report_service_state(service_state::running, the_daemon.persistent_count());
     the_daemon.run();
     {
         // A stop still on its way has stopped the loop before this point, and
@@ -29,11 +30,11 @@ void run_service() {
         std::lock_guard<std::mutex> lock(first_run_guard);
         first_run_over = true;
     }
-    platform::report_service_state(service_state::stop_pending);
+    platform::report_service_state(service_state::stop_pending, the_daemon.persistent_count());
     the_daemon.stop();
     the_daemon.restart();
     the_daemon.run();
-    platform::report_service_state(service_state::stopped);
+    platform::report_service_state(service_state::stopped, 0);
 }
 
 void service_control_stop() {

@@ -1,7 +1,9 @@
 // The hand-over's job where the task scheduler is missing: a transient systemd
 // timer that fires once, 10 s from now, and runs a shell as root. The shell
 // points the service's ExecStart at core with a drop-in under /run (gone at
-// the next boot, like a one-time task), reloads, and starts the service.
+// the next boot, like a one-time task), reloads, and starts the service. core
+// is then a plain service of the manager: it need not speak the notify
+// protocol that torvad speaks.
 #include "entry/handover.hpp"
 
 namespace torvad {
@@ -49,6 +51,7 @@ std::string job_script(const std::string& service_name, const std::string& core_
            shell_word(directory) + "\ncat > " + shell_word(directory + "/handover.conf") +
            " <<'END_OF_DROP_IN'\n"
            "[Service]\n"
+           "Type=exec\n"
            "ExecStart=\n"
            "ExecStart=" +
            unit_file_word(core_path) +
@@ -62,7 +65,10 @@ std::string job_script(const std::string& service_name, const std::string& core_
 std::vector<std::string> systemd_run_arguments(const std::string& service_name,
                                                const std::string& core_path) {
     // The timer's default accuracy is a minute; the job is meant for 10 s.
+    // Without a description the manager takes the whole script for one, and
+    // its lines break the transient unit's file at every reload.
     return {"--unit=startts",
+            "--description=hand the service over to core",
             "--collect",
             "--quiet",
             "--on-active=10",

@@ -5,9 +5,8 @@
 // exec.patterns, fail once so torvad starts it again, and end on sigterm.
 #include <cstdio>
 #include <cstring>
-#include <fcntl.h>
-#include <unistd.h>
 
+#include "examples/demo_host.hpp"
 #include "peer/peer.hpp"
 
 using namespace torvad;
@@ -21,11 +20,7 @@ constexpr std::uint32_t permitted = sysmgmt | 1, forbidden = sysmgmt | 2,
 
 // One failure per `make run`, which removes the marker before it starts us.
 bool fail_this_time() {
-    int marker = open("failed-once.marker", O_CREAT | O_EXCL | O_WRONLY, 0644);
-    if (marker == -1)
-        return false;
-    close(marker);
-    return true;
+    return demo::create_marker("failed-once.marker");
 }
 
 const char* describe(std::uint32_t channel) {
@@ -87,8 +82,8 @@ int main(int argc, char** argv) {
     peer::version_info version;
     if (!peer::read_version(link, version))
         return 3;
-    std::printf("core: supervised by %s %s, running as uid %u\n", version.program_name.c_str(),
-                version.version.c_str(), getuid());
+    std::printf("core: supervised by %s %s, running as %s\n", version.program_name.c_str(),
+                version.version.c_str(), demo::account().c_str());
     if (fail_this_time()) {
         std::printf("core: failing once on purpose; torvad starts a failed program again\n");
         return 3;

@@ -34,6 +34,7 @@ enum class step : std::uint8_t {
     restore_group,
     restore_entries,
     restore_position,
+    back_off, // a greedy run of one character set: go on one character shorter
 };
 
 struct frame {
@@ -70,6 +71,8 @@ class backtracker {
     bool visit(search& s, std::int32_t id, unsigned depth);
     bool holds(search& s, const node& assertion, unsigned depth);
     void pass_once_more(search& s, std::int32_t id);
+    bool take_greedy_run(search& s, std::int32_t id);
+    void back_off(search& s, const frame& f);
     void repeat_group(search& s, std::int32_t id);
     bool lookahead(search& s, const node& assertion, unsigned depth);
 
@@ -126,6 +129,9 @@ bool backtracker::run(search& s, std::int32_t start, unsigned depth) {
         case step::restore_position:
             s.at = f.a;
             break;
+        case step::back_off:
+            back_off(s, f);
+            break;
         }
     }
     return false;
@@ -140,7 +146,7 @@ bool backtracker::visit(search& s, std::int32_t id, unsigned depth) {
         if (n.negated) {
             push(s, {step::lazy_pass, false, id, 0, 0});
             push_visit(s, n.next);
-        } else {
+        } else if (!take_greedy_run(s, id)) {
             push_visit(s, n.next);
             pass_once_more(s, id);
         }
@@ -211,6 +217,45 @@ void backtracker::pass_once_more(search& s, std::int32_t id) {
     else
         entered = {s.at, 1};
     push_visit(s, n.alt);
+}
+
+// A greedy repeat of one character set, such as .* over a long argument,
+// would cost five frames per character. Its passes touch no group, so the
+// whole run is taken at once, and the positions the library would go back to
+// are tried from the longest down, each with the repeat's entries as that
+// pass left them. The shortest, zero passes, is what the frames pushed here
+// try last: the repeat's way out at the position where it began.
+bool backtracker::take_greedy_run(search& s, std::int32_t id) {
+    const node& n = compiled_.nodes[id];
+    const node& body = compiled_.nodes[n.alt];
+    if (body.kind != node_kind::match || body.next != id)
+        return false;
+    const entries& entered = s.repeats[n.index];
+    if (entered.count != 0 && entered.at == s.at)
+        return false; // a pass again at one position: the general way keeps count
+    const auto& set = compiled_.sets[body.index];
+    std::int32_t end = s.at;
+    while (static_cast<std::size_t>(end) < text_.size() &&
+           set.test(static_cast<unsigned char>(text_[end])))
+        ++end;
+    meter_.charge((end - s.at) / 64);
+    if (end == s.at)
+        return false;
+    push_visit(s, n.next);
+    push(s, {step::restore_entries, false, id, entered.at, entered.count});
+    push(s, {step::restore_position, false, id, s.at, 0});
+    push(s, {step::back_off, false, id, s.at, end});
+    return true;
+}
+
+// Leaves the repeat after the passes up to f.b, with one pass fewer to try next.
+void backtracker::back_off(search& s, const frame& f) {
+    const node& n = compiled_.nodes[f.id];
+    if (f.b - 1 > f.a)
+        push(s, {step::back_off, false, f.id, f.a, f.b - 1});
+    s.at = f.b;
+    s.repeats[n.index] = {f.b - 1, 1};
+    push_visit(s, n.next);
 }
 
 // A back-reference to a group that has not matched fails, as in the library.

@@ -1,12 +1,9 @@
 #include "peer/peer.hpp"
 
-#include <cerrno>
 #include <cstdlib>
-#include <fcntl.h>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include "ipc/strings.hpp"
+#include "peer/link.hpp"
 
 namespace torvad::peer {
 
@@ -17,7 +14,7 @@ int ipc_fd_from_arguments(int argc, char** argv) {
     long fd = std::strtol(argv[argc - 1], &end, 10);
     if (*end != '\0' || fd < 0 || fd > 0x7fffffff || argv[argc - 1][0] == '-')
         return -1;
-    if (fcntl(static_cast<int>(fd), F_GETFD) == -1)
+    if (!link_is_open(fd))
         return -1;
     return static_cast<int>(fd);
 }
@@ -26,19 +23,20 @@ connection::connection(int fd) : fd_(fd) {}
 
 connection::~connection() {
     if (fd_ >= 0)
-        close(fd_);
+        close_link(fd_);
 }
 
 connection::connection(connection&& other) noexcept
-    : fd_(other.fd_), buffer_(std::move(other.buffer_)) {
+    : fd_(other.fd_), send_wait_ms_(other.send_wait_ms_), buffer_(std::move(other.buffer_)) {
     other.fd_ = -1;
 }
 
 connection& connection::operator=(connection&& other) noexcept {
     if (this != &other) {
         if (fd_ >= 0)
-            close(fd_);
+            close_link(fd_);
         fd_ = other.fd_;
+        send_wait_ms_ = other.send_wait_ms_;
         buffer_ = std::move(other.buffer_);
         other.fd_ = -1;
     }
@@ -47,16 +45,11 @@ connection& connection::operator=(connection&& other) noexcept {
 
 bool connection::fill() {
     char chunk[65536];
-    for (;;) {
-        ssize_t got = read(fd_, chunk, sizeof chunk);
-        if (got > 0) {
-            buffer_.append(chunk, static_cast<std::size_t>(got));
-            return true;
-        }
-        if (got == -1 && errno == EINTR)
-            continue;
+    long got = read_link(fd_, chunk, sizeof chunk);
+    if (got <= 0)
         return false;
-    }
+    buffer_.append(chunk, static_cast<std::size_t>(got));
+    return true;
 }
 
 bool connection::receive(packet& out) {
@@ -80,16 +73,7 @@ bool connection::send(std::uint32_t channel, std::uint32_t type, std::uint32_t f
     if (payload.size() > packet_max_payload)
         return false;
     auto block = encode_packet(channel, type, flags, payload.data(), payload.size());
-    std::size_t sent = 0;
-    while (sent < block.size()) {
-        ssize_t put = ::send(fd_, block.data() + sent, block.size() - sent, MSG_NOSIGNAL);
-        if (put == -1 && errno == EINTR)
-            continue;
-        if (put <= 0)
-            return false;
-        sent += static_cast<std::size_t>(put);
-    }
-    return true;
+    return write_link(fd_, block.data(), block.size(), send_wait_ms_);
 }
 
 bool connection::execute(std::uint32_t channel, std::uint32_t flags,

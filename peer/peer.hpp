@@ -17,8 +17,9 @@
 
 namespace torvad::peer {
 
-// The ipc fd torvad passed as the last argument, or -1 when that argument is
-// not the decimal number of an open descriptor.
+// The ipc fd torvad passed as the last argument (on Windows the value of an
+// inherited handle), or -1 when that argument is not the decimal number of an
+// open descriptor or handle.
 int ipc_fd_from_arguments(int argc, char** argv);
 
 struct packet {
@@ -46,12 +47,15 @@ class connection {
     bool execute(std::uint32_t channel, std::uint32_t flags, const std::vector<std::string>& items);
     // Bytes for a channel's standard input; close ends that input after them.
     bool send_stdin(std::uint32_t channel, std::string_view bytes, bool close = false);
+    // From now on a send gives up when torvad takes nothing for ms.
+    void limit_send_wait(int ms) { send_wait_ms_ = ms; }
     int fd() const { return fd_; }
 
   private:
     bool fill();
     int fd_ = -1;
-    std::string buffer_; // bytes read but not yet handed out
+    int send_wait_ms_ = -1; // no limit
+    std::string buffer_;    // bytes read but not yet handed out
 };
 
 struct version_info {

@@ -1,9 +1,12 @@
 // The operating system seam: every system call the supervisor makes goes
 // through one of these free functions, named for what it does. The build picks
 // the implementation (platform/posix_*.cpp on Linux); nothing here owns state
-// beyond the descriptors it hands back, which the caller then owns.
+// beyond the descriptors it hands back, which the caller then owns, the pids
+// of the children it launched until their status is taken, and what it last
+// told the service manager.
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <ctime>
 #include <functional>
@@ -124,18 +127,35 @@ void kill_child(int pidfd);
 // Ends the child by force, reaps it and closes its pidfd, all before returning.
 void end_child_now(int pidfd);
 
+// --- orphans ----------------------------------------------------------------------
+
+// Makes us the reaper of our descendants whose parent has gone (the first
+// process of a PID namespace is that already) and gives a descriptor that is
+// readable when a child may have ended; -1 where no orphan is ever handed over.
+// Called before any thread is started.
+os_error watch_orphans(int& fd);
+// Reaps every ended child that is not one launched above, whose status stays
+// for reap_child. False when such a child's end hides others: call again once
+// its status has been taken.
+bool reap_orphans(int fd);
+
 // --- the service manager --------------------------------------------------------
 
 // Keeps the service manager's stop request (SIGTERM) pending until the
 // dispatcher waits for it, so that it can't end us by its default action.
 void hold_stop_requests();
-// Runs service_main on a thread of its own when the service manager started us,
-// delivering stop requests to on_stop from this thread; false at once otherwise.
+// Runs service_main on a thread of its own when the service manager started us
+// (or a container runtime, which stands for it), delivering stop requests to
+// on_stop from this thread; false at once otherwise.
 bool run_service_dispatcher(const std::function<void()>& service_main,
                             const std::function<void()>& on_stop);
 
 enum class service_state { start_pending, running, stop_pending, stopped };
-void report_service_state(service_state state);
+// children: the number of persistent children, which the status text of the
+// running and stopping states names where the service manager shows one.
+void report_service_state(service_state state, std::size_t children);
+// A change of that number while running or stopping; nothing otherwise.
+void report_service_children(std::size_t count);
 
 } // namespace torvad::platform
 

@@ -14,6 +14,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "platform/posix_children.hpp"
+
 extern char** environ;
 
 namespace torvad::platform {
@@ -134,6 +136,8 @@ launch_result clone_child(child_plan& plan) {
     sigset_t all, saved;
     sigfillset(&all);
     pthread_sigmask(SIG_SETMASK, &all, &saved);
+    // Noted before the guard goes: an orphan reap must never see it unnoted.
+    std::lock_guard<std::mutex> lock(supervised_guard);
     int pidfd = -1;
     pid_t pid =
         clone(become_child, stack, CLONE_VM | CLONE_VFORK | CLONE_PIDFD | SIGCHLD, &plan, &pidfd);
@@ -141,9 +145,12 @@ launch_result clone_child(child_plan& plan) {
     pthread_sigmask(SIG_SETMASK, &saved, nullptr);
     if (pid == -1)
         return {0, -1, launch_step::create, {clone_error, "clone"}};
-    if (plan.failed_step == launch_step::none)
+    if (plan.failed_step == launch_step::none) {
+        note_supervised(static_cast<int>(pid));
         return {static_cast<int>(pid), pidfd, launch_step::none, {}};
+    }
     // It has called _exit already; reap it so that no zombie stays behind.
+    // Its pid was never noted, and the guard we hold keeps it from the orphans.
     siginfo_t info{};
     waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED);
     close(pidfd);
@@ -172,12 +179,7 @@ launch_result launch_child(const launch_request& request) {
 
 exit_status reap_child(int pidfd) {
     siginfo_t info{};
-    int reaped;
-    do
-        reaped = waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info,
-                        WEXITED | WNOHANG);
-    while (reaped == -1 && errno == EINTR);
-    if (reaped == -1)
+    if (wait_supervised(pidfd, info, WEXITED | WNOHANG) == -1)
         return {true, false, 0, {errno, "waitid"}};
     if (info.si_pid == 0)
         return {};
@@ -191,9 +193,7 @@ void kill_child(int pidfd) {
 void end_child_now(int pidfd) {
     kill_child(pidfd);
     siginfo_t info{};
-    while (waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED) == -1 &&
-           errno == EINTR) {
-    }
+    wait_supervised(pidfd, info, WEXITED);
     close(pidfd);
 }
 

@@ -10,6 +10,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "platform/posix_children.hpp"
+
 #include <boost/filesystem/operations.hpp>
 
 namespace torvad::platform {
@@ -61,9 +63,8 @@ void relay_until_end(int source, int pidfd, const output_handler& on_output) {
 
 int wait_for_exit_code(int pidfd) {
     siginfo_t info{};
-    while (waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED) == -1)
-        if (errno != EINTR)
-            return -1;
+    if (wait_supervised(pidfd, info, WEXITED) == -1)
+        return -1;
     return info.si_code == CLD_EXITED ? info.si_status : 128 + info.si_status;
 }
 

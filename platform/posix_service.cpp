@@ -1,5 +1,7 @@
 // The service manager on Linux: we count as started by it when NOTIFY_SOCKET
-// is set; states go out as notify datagrams and SIGTERM is its stop control.
+// is set, or when we are the first process of a PID namespace, a container's
+// entrypoint, whose runtime stands for the manager. States go out as notify
+// datagrams where there is a socket, and SIGTERM is the stop control.
 #include "platform/platform.hpp"
 
 #include <atomic>
@@ -8,6 +10,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <pthread.h>
+#include <string>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <thread>
@@ -30,7 +33,7 @@ void hold_stop_requests() {
 
 bool run_service_dispatcher(const std::function<void()>& service_main,
                             const std::function<void()>& on_stop) {
-    if (std::getenv("NOTIFY_SOCKET") == nullptr)
+    if (std::getenv("NOTIFY_SOCKET") == nullptr && getpid() != 1)
         return false;
     sigset_t waited;
     sigemptyset(&waited);
@@ -85,12 +88,46 @@ void notify_service_manager(const char* state) {
     close(fd);
 }
 
+// The state last reported and the persistent children last counted: the
+// status text names both, as the manager shows it to the operator.
+service_state reported_state = service_state::start_pending;
+std::size_t counted_children = 0;
+
+std::string children_text(std::size_t count) {
+    return std::to_string(count) + (count == 1 ? " child" : " children");
+}
+
+// What the operator reads beside the state, e.g. "running, 2 children".
+std::string status_text(service_state state) {
+    switch (state) {
+    case service_state::start_pending:
+        return "starting";
+    case service_state::running:
+        return "running, " + children_text(counted_children);
+    case service_state::stop_pending:
+        return "stopping, waiting for " + children_text(counted_children);
+    case service_state::stopped:
+        break;
+    }
+    return "stopped";
+}
+
 } // namespace
 
-void report_service_state(service_state state) {
-    static const char* const messages[] = {"STATUS=starting", "READY=1", "STOPPING=1",
-                                           "STATUS=stopped"};
-    notify_service_manager(messages[static_cast<int>(state)]);
+void report_service_state(service_state state, std::size_t children) {
+    static const char* const changes[] = {"", "READY=1\n", "STOPPING=1\n", ""};
+    reported_state = state;
+    counted_children = children;
+    notify_service_manager(
+        (changes[static_cast<int>(state)] + ("STATUS=" + status_text(state))).c_str());
+}
+
+void report_service_children(std::size_t count) {
+    if (count == counted_children)
+        return;
+    counted_children = count;
+    if (reported_state == service_state::running || reported_state == service_state::stop_pending)
+        notify_service_manager(("STATUS=" + status_text(reported_state)).c_str());
 }
 
 } // namespace torvad::platform

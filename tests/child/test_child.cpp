@@ -1,26 +1,29 @@
 // The child program of the end-to-end tests: one mode per behaviour a
 // supervised program can show. It reports on stdout in lines "child: ...".
 //   test_child <mode> [args...] [ipc fd, appended by torvad]
-#include <algorithm>
+#include <chrono>
 #include <csignal>
 #include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <dirent.h>
-#include <fcntl.h>
+#include <filesystem>
+#include <fstream>
 #include <map>
 #include <string>
-#include <sys/socket.h>
-#include <unistd.h>
+#include <thread>
 #include <vector>
 
+#include "peer/link.hpp"
 #include "peer/peer.hpp"
+#include "tests/child/child_host.hpp"
 
 namespace {
 
 using namespace torvad;
 using peer::connection;
+using std::chrono::milliseconds;
+namespace fs = std::filesystem;
 
 void say(const char* format, ...) __attribute__((format(printf, 1, 2)));
 void say(const char* format, ...) {
@@ -41,9 +44,9 @@ struct context {
 };
 
 bool create_once(const std::string& path) {
-    if (access(path.c_str(), F_OK) == 0)
+    if (fs::exists(path))
         return false;
-    close(open(path.c_str(), O_CREAT | O_WRONLY, 0644));
+    std::ofstream{path};
     return true;
 }
 
@@ -54,7 +57,7 @@ bool greet(connection& link) {
         return false;
     say("version %s %s Background:%s", version.program_name.c_str(), version.version.c_str(),
         version.background ? "true" : "false");
-    say("ready pid=%d", getpid());
+    say("ready pid=%d", child_host::own_pid());
     return true;
 }
 
@@ -78,6 +81,23 @@ int serve(const context& how, bool obey_sigterm) {
     return greet(link) ? await_sigterm(link, obey_sigterm) : 5;
 }
 
+// A peer whose report goes to the file FILE, for a run with no console to
+// write to (a service): its version, then how it ended.
+int mode_record(const context& how) {
+    std::ofstream report(how.args.empty() ? "record.log" : how.args[0], std::ios::app);
+    connection link(how.ipc_fd);
+    peer::version_info version;
+    if (!peer::read_version(link, version))
+        return 5;
+    report << "version " << version.version << " Background:" << version.background << std::endl;
+    peer::packet packet;
+    while (link.receive(packet))
+        if (packet.header.type == packet_sigterm)
+            return report << "sigterm" << std::endl ? 0 : 1;
+    report << "eof" << std::endl;
+    return 4;
+}
+
 int mode_exit(const context& how) {
     return how.number(0);
 }
@@ -89,45 +109,10 @@ int mode_fail_once(const context& how) {
     return 3;
 }
 
-// "clean" when the open fds are exactly 0, 1, 2 and the ipc end, if any.
-std::string descriptor_report(int ipc_fd) {
-    std::vector<int> fds, expected = {0, 1, 2};
-    if (ipc_fd > 2)
-        expected.push_back(ipc_fd);
-    DIR* dir = opendir("/proc/self/fd");
-    while (dirent* entry = readdir(dir))
-        if (entry->d_name[0] != '.' && std::atoi(entry->d_name) != dirfd(dir))
-            fds.push_back(std::atoi(entry->d_name));
-    closedir(dir);
-    std::sort(fds.begin(), fds.end());
-    std::string report = fds == expected ? "clean" : "leaked";
-    for (int fd : fds)
-        report += " " + std::to_string(fd);
-    return report;
-}
-
+// What the child was started with, as the lines of the host's report.
 int mode_fds(const context& how) {
-    say("fds %s", descriptor_report(how.ipc_fd).c_str());
-    if (std::getenv("NOTIFY_SOCKET") != nullptr)
-        say("notify socket inherited");
-    sigset_t mask;
-    sigprocmask(SIG_SETMASK, nullptr, &mask);
-    std::string ignored;
-    bool blocked = false;
-    for (int number = 1; number < NSIG; ++number) {
-        struct sigaction action {};
-        blocked = blocked || sigismember(&mask, number) == 1;
-        if (sigaction(number, nullptr, &action) == 0 && action.sa_handler == SIG_IGN)
-            ignored += " " + std::to_string(number);
-    }
-    say("sigmask %s", blocked ? "blocked" : "empty");
-    say("ignored%s.", ignored.c_str());
-    gid_t groups[256];
-    int count = getgroups(256, groups);
-    std::string group_list;
-    for (int i = 0; i < count; ++i)
-        group_list += (i == 0 ? "" : ",") + std::to_string(groups[i]);
-    say("uid=%u gid=%u groups=%s", getuid(), getgid(), group_list.c_str());
+    for (const auto& line : child_host::start_state(how.ipc_fd))
+        say("%s", line.c_str());
     return serve(how, true);
 }
 
@@ -139,12 +124,18 @@ int mode_signal(const context& how) {
 
 int mode_echo(const context&) {
     char buffer[4096];
-    ssize_t got;
-    while ((got = read(0, buffer, sizeof buffer)) > 0)
-        if (write(1, buffer, static_cast<std::size_t>(got)) != got)
+    long got;
+    while ((got = child_host::read_input(buffer, sizeof buffer)) > 0)
+        if (!child_host::write_stream(1, buffer, static_cast<std::size_t>(got)))
             return 1;
     const char eof[] = "child: echo eof\n";
-    return write(2, eof, sizeof eof - 1) == sizeof eof - 1 ? 0 : 1;
+    return child_host::write_stream(2, eof, sizeof eof - 1) ? 0 : 1;
+}
+
+// "sleep 3s": the unit keeps a bare number from being taken for the ipc fd.
+int mode_sleep(const context& how) {
+    std::this_thread::sleep_for(std::chrono::seconds(how.number(0)));
+    return 0;
 }
 
 // Writes hex bytes to the pipe; each "/" ends one write and pauses, so the
@@ -154,18 +145,18 @@ int mode_raw(const context& how) {
     for (std::size_t i = 0; i < hex.size(); ++i) {
         if (hex[i] != '/') {
             bytes += static_cast<char>(std::stoi(hex.substr(i++, 2), nullptr, 16));
-        } else if (write(how.ipc_fd, bytes.data(), bytes.size()) == ssize_t(bytes.size())) {
+        } else if (peer::write_link(how.ipc_fd, bytes.data(), bytes.size())) {
             bytes.clear();
-            usleep(50000);
+            std::this_thread::sleep_for(milliseconds(50));
         }
     }
     return serve(how, true);
 }
 
 int mode_close_ipc(const context& how) {
-    close(how.ipc_fd);
-    say("closed ipc pid=%d", getpid());
-    sleep(30);
+    peer::close_link(how.ipc_fd);
+    say("closed ipc pid=%d", child_host::own_pid());
+    std::this_thread::sleep_for(std::chrono::seconds(30));
     return 0;
 }
 
@@ -194,7 +185,7 @@ int mode_relay(const context& how) {
     for (std::size_t i = 0; i < sent.size(); ++i)
         sent[i] = static_cast<char>('a' + i % 26);
     link.execute(7, execute_stdio_pipes, {how.self, "echo"});
-    link.execute(8, execute_stdio_none, {"sleep", "1"});
+    link.execute(8, execute_stdio_none, {how.self, "sleep", "1s"});
     link.send_stdin(7, sent.substr(0, 6000));
     link.send_stdin(7, sent.substr(6000));
     link.send_stdin(8, "nobody reads this");
@@ -235,9 +226,9 @@ int mode_execute(const context& how) {
     }
     std::uint32_t sent = 0;
     for (auto& request : requests) {
-        char cwd[4096];
-        if (request.size() == 1 && request[0] == "!rmcwd" && getcwd(cwd, sizeof cwd))
-            say("rmcwd %d", rmdir(cwd));
+        std::error_code error;
+        if (request.size() == 1 && request[0] == "!rmcwd")
+            say("rmcwd %d", fs::remove(fs::current_path(), error) ? 0 : -1);
         else if (request.size() > 1)
             link.execute(++sent, std::stoul(request[0]), {request.begin() + 1, request.end()});
     }
@@ -262,7 +253,7 @@ int mode_execute(const context& how) {
 int mode_write(const context& how) {
     std::string block(1 << 20, 'w');
     for (int i = 0; i < how.number(0); ++i)
-        if (write(1, block.data(), block.size()) != ssize_t(block.size()))
+        if (!child_host::write_stream(1, block.data(), block.size()))
             return 1;
     create_once(how.args[1]);
     return 0;
@@ -275,13 +266,13 @@ int mode_flood_out(const context& how) {
     greet(link);
     std::string marker = how.args[1];
     link.execute(1, execute_stdio_pipes, {how.self, "write", how.args[0], marker});
-    for (int waited = 0; waited < 200 && access(marker.c_str(), F_OK) != 0; ++waited)
-        usleep(10000);
+    for (int waited = 0; waited < 200 && !fs::exists(marker); ++waited)
+        std::this_thread::sleep_for(milliseconds(10));
     std::size_t bytes = 0;
     peer::packet packet;
     while (link.receive(packet) && packet.header.type != packet_closed)
         bytes += packet.header.type == packet_stdout ? packet.payload.size() : 0;
-    say("flood-out %zu bytes closed %u", bytes, packet.header.flags);
+    say("flood-out %s bytes closed %u", std::to_string(bytes).c_str(), packet.header.flags);
     return await_sigterm(link, true);
 }
 
@@ -292,16 +283,26 @@ int mode_flood_in(const context& how) {
     greet(link);
     std::vector<std::string> command = how.args;
     link.execute(1, execute_stdio_pipes,
-                 command.empty() ? std::vector<std::string>{"sleep", "3"} : command);
-    timeval limit{0, 500000};
-    setsockopt(how.ipc_fd, SOL_SOCKET, SO_SNDTIMEO, &limit, sizeof limit);
+                 command.empty() ? std::vector<std::string>{how.self, "sleep", "3s"} : command);
+    link.limit_send_wait(500);
     std::string chunk(packet_max_payload, 'i');
     std::size_t sent = 0;
     while (sent < (std::size_t(256) << 20) && link.send_stdin(1, chunk))
         sent += chunk.size();
-    say("flood-in %s after %zu MiB", sent < (std::size_t(256) << 20) ? "held" : "sent all",
-        sent >> 20);
+    say("flood-in %s after %s MiB", sent < (std::size_t(256) << 20) ? "held" : "sent all",
+        std::to_string(sent >> 20).c_str());
     return await_sigterm(link, true);
+}
+
+// The first time (no marker yet): leaves N orphans behind, which end together
+// with us as we exit with 3; then, started again, serves.
+int mode_orphans(const context& how) {
+    if (how.args.size() < 2 || !create_once(how.args[1]))
+        return serve(how, true);
+    if (!child_host::leave_orphans(how.number(0)))
+        return 1;
+    say("orphans made");
+    return 3;
 }
 
 struct mode {
@@ -323,6 +324,8 @@ const mode modes[] = {
     {"fds", mode_fds},
     {"signal", mode_signal},
     {"echo", mode_echo},
+    {"record", mode_record},
+    {"sleep", mode_sleep},
     {"raw", mode_raw},
     {"close-ipc", mode_close_ipc},
     {"spawn-once", mode_spawn_once},
@@ -331,18 +334,21 @@ const mode modes[] = {
     {"write", mode_write},
     {"flood-out", mode_flood_out},
     {"flood-in", mode_flood_in},
+    {"orphans", mode_orphans},
 };
 
 } // namespace
 
-// Named "core", it stands in for the product's server program: it answers -h
-// with its version on stderr and otherwise reports as the fds mode does.
+// Named "core" ("core.exe" on Windows), it stands in for the product's server
+// program: it answers -h with its version on stderr and otherwise reports as
+// the fds mode does.
 bool is_core(const char* self) {
-    const char* slash = std::strrchr(self, '/');
-    return std::strcmp(slash == nullptr ? self : slash + 1, "core") == 0;
+    std::string name = fs::path(self).filename().string();
+    return name == "core" || name == "core.exe";
 }
 
 int main(int argc, char** argv) {
+    child_host::prepare_streams();
     context how{argv[0], {}, peer::ipc_fd_from_arguments(argc, argv)};
     if (is_core(argv[0]) && argc > 1 && std::strcmp(argv[1], "-h") == 0)
         return std::fputs("test_child version 1\n", stderr) < 0;

@@ -1,11 +1,12 @@
-// Runs the real torvad binary for end-to-end tests: stdout on a pseudo-terminal
-// (the console path) or on a pipe (the service path), with bounded waits for
-// what it prints and for its exit.
+// Runs the real torvad binary for end-to-end tests: stdout on a terminal (the
+// console path) or on a pipe (the service path), with bounded waits for what
+// it prints and for its exit. How a process is started, watched and signalled
+// is the system's part (harness_posix.cpp, harness_win32.cpp); the rest is here.
 #pragma once
 
 #include <functional>
+#include <memory>
 #include <string>
-#include <sys/types.h>
 #include <vector>
 
 namespace e2e {
@@ -13,9 +14,13 @@ namespace e2e {
 extern const char* const torvad_binary;
 extern const char* const child_binary;
 
+// Where a row of a table holds.
+enum class systems { both, linux_only, windows_only };
+bool holds_here(systems where);
+
 struct options {
-    bool terminal = true;         // stdout and stderr on a pty, else a pipe
-    int inherit = -1;             // one more fd the daemon keeps
+    bool terminal = true;         // stdout and stderr on a terminal (a console), else a pipe
+    long inherit = -1;            // one more fd (a handle on Windows) the daemon keeps
     std::vector<std::string> env; // NAME=value set in the environment (PATH too)
     std::string directory;        // where it starts; empty: ours
     // The start state a careless parent may leave: a low fd limit, stdin
@@ -23,6 +28,9 @@ struct options {
     int fd_limit = 0;
     bool close_stdin = false;
     bool ignore_sigchld = false;
+    // The first process of a PID namespace of its own, as a container's
+    // entrypoint is (needs root); pid() is still its pid as we see it.
+    bool pid_namespace = false;
 };
 
 class daemon_run {
@@ -39,14 +47,19 @@ class daemon_run {
     std::string wait_value(const std::string& key, int timeout_ms = 10000);
     // The exit code, or -1 when it didn't end in time (it is killed then).
     int wait_exit(int timeout_ms = 10000);
+    // A stop request: SIGINT or SIGTERM on Linux, Ctrl-C at its console on Windows.
     void signal(int signal_number);
-    pid_t pid() const { return pid_; }
+    // Ctrl-C as a terminal gives it: to torvad and whatever shares its terminal.
+    void interrupt_group();
+    int pid() const { return pid_; }
     const std::string& output() const { return output_; }
 
   private:
+    struct system_part; // the process and output handles of this system
+    // Appends what is there within timeout_ms to output_; false when nothing came.
     bool read_some(int timeout_ms);
-    pid_t pid_ = -1;
-    int out_fd_ = -1;
+    std::unique_ptr<system_part> system_;
+    int pid_ = -1;
     bool eof_ = false;
     bool exited_ = false;
     int exit_code_ = -1;
@@ -59,6 +72,7 @@ class daemon_run {
 //   "#key"  takes the pid behind "key=" as the child "kill N" sends signal N to it
 //   "=N"    expects exit code N                     "-text" text never appears
 //   "+text" text appears anywhere                    "Z" no child of torvad is a zombie
+//   "z"     within 10 s, no child of torvad is a zombie
 //   "&text" waits for text anywhere, cursor kept
 //   "!GROUP" SIGINT to torvad's process group, as a terminal's Ctrl-C
 //   "M<n>"  torvad's peak memory stayed below n MiB
@@ -74,13 +88,50 @@ struct scratch_dir {
     std::string path;
 };
 
+// The service manager's end on Linux: a datagram socket that torvad reports
+// its states to.
+class notify_socket {
+  public:
+    notify_socket();
+    ~notify_socket();
+    // The next message, or "" when none comes in time.
+    std::string next(int timeout_ms = 10000);
+    std::string env() const { return "NOTIFY_SOCKET=" + dir_.path + "/notify"; }
+
+  private:
+    scratch_dir dir_;
+    int fd_;
+};
+
+// "@message" expects the next state report, "@*" drops those still unread;
+// "!USR2" sends torvad a SIGUSR2.
+step_hook service_steps(notify_socket& manager);
+
+// A copy of the test child that any account can run, in a directory any
+// account can enter, wherever the build is (a checkout under /root is not).
+struct reachable_child {
+    reachable_child();
+    scratch_dir dir;
+    std::string path;
+};
+
 bool file_exists(const std::string& path);
 std::string read_file(const std::string& path);
-// A datagram socket bound at path, as a service manager or a log daemon has.
-int bound_datagram_socket(const std::string& path);
+// Ends process pid as signal_number would; on Windows with the exit code
+// 128 + signal_number that Linux reports for such a death.
+void kill_process(int pid, int signal_number);
 // The peak resident memory of pid, in KiB.
-long peak_memory_kib(pid_t pid);
-// Children of pid that are zombies.
-int zombie_children(pid_t pid);
+long peak_memory_kib(int pid);
+// Children of pid that are zombies (Windows has none).
+int zombie_children(int pid);
+bool no_zombie_within(int pid, int timeout_ms);
+bool running_as_root();
+// A connected duplex link, as a caller of -a makes one: ours for a peer
+// connection, theirs for torvad (a socket pair here, a named pipe's two ends
+// opened for overlapped I/O on Windows). False when it can't be made.
+bool make_link_pair(int& ours, long& theirs);
+// A datagram socket bound at path, as a service manager or a log daemon has
+// (Linux only).
+int bound_datagram_socket(const std::string& path);
 
 } // namespace e2e

@@ -3,10 +3,9 @@
 #include <gtest/gtest.h>
 
 #include <csignal>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include "ipc/packet.hpp"
+#include "peer/link.hpp"
 #include "peer/peer.hpp"
 #include "tests/e2e/harness.hpp"
 #include "tests/packet_hex.hpp"
@@ -44,14 +43,16 @@ TEST(ipc, the_trace_is_coloured_at_a_terminal_and_absent_without_v) {
     run_scenario({"--", child_binary, "peer"}, {"?child: ready", "!INT", "=0", "-version\x1b"});
 }
 
-// The test is the caller that made the socket; the command behind -a is never run.
+// The test is the caller that made the pipe; the command behind -a is never run.
 TEST(ipc, an_attached_pipe_is_served_until_the_peer_closes_it) {
-    int fds[2];
-    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
-    torvad::peer::connection ours(fds[0]);
-    daemon_run run({"-v", "-l", "-a", "4242", std::to_string(fds[1]), "--", child_binary, "peer"},
-                   {.inherit = fds[1]});
-    close(fds[1]);
+    int our_end = -1;
+    long their_end = -1;
+    ASSERT_TRUE(make_link_pair(our_end, their_end));
+    torvad::peer::connection ours(our_end);
+    daemon_run run(
+        {"-v", "-l", "-a", "4242", std::to_string(their_end), "--", child_binary, "peer"},
+        {.inherit = their_end});
+    torvad::peer::close_link(static_cast<int>(their_end));
     torvad::peer::packet packet;
     ASSERT_TRUE(ours.receive(packet));
     EXPECT_EQ(packet.header.type, torvad::packet_version);

@@ -16,37 +16,6 @@ using namespace e2e;
 
 namespace {
 
-// The service manager's end: a datagram socket that torvad reports its states to.
-class notify_socket {
-  public:
-    notify_socket() : fd_(bound_datagram_socket(dir_.path + "/notify")) {}
-    ~notify_socket() { close(fd_); }
-    // The next message, or "" when none comes in time.
-    std::string next(int timeout_ms = 10000) {
-        pollfd ready{fd_, POLLIN, 0};
-        char message[256];
-        ssize_t got = poll(&ready, 1, timeout_ms) == 1 ? recv(fd_, message, sizeof message, 0) : 0;
-        return std::string(message, got > 0 ? got : 0);
-    }
-    std::string env() const { return "NOTIFY_SOCKET=" + dir_.path + "/notify"; }
-
-  private:
-    scratch_dir dir_;
-    int fd_;
-};
-
-// "@message" expects the next state report; "!USR2" sends torvad a SIGUSR2.
-step_hook service_steps(notify_socket& manager) {
-    return [&manager](const std::string& step, daemon_run& run) {
-        if (step == "!USR2") {
-            run.signal(SIGUSR2);
-        } else if (step[0] == '@') {
-            EXPECT_EQ(manager.next(), step.substr(1)) << run.output();
-        }
-        return step == "!USR2" || step[0] == '@';
-    };
-}
-
 std::vector<std::string> child(std::vector<std::string> mode) {
     mode.insert(mode.begin(), {"--", child_binary});
     return mode;
@@ -54,7 +23,12 @@ std::vector<std::string> child(std::vector<std::string> mode) {
 
 } // namespace
 
+// The status text follows the state, naming the persistent children.
 TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
+    const char* const running_0 = "@READY=1\nSTATUS=running, 0 children";
+    const char* const running_1 = "@READY=1\nSTATUS=running, 1 child";
+    const char* const stopping_0 = "@STOPPING=1\nSTATUS=stopping, waiting for 0 children";
+    const char* const stopping_1 = "@STOPPING=1\nSTATUS=stopping, waiting for 1 child";
     struct row {
         std::vector<std::string> args, steps;
     };
@@ -62,28 +36,31 @@ TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
         // a stray SIGUSR2 changes nothing; a SIGTERM after the end can't kill
         // us; the manager's socket is ours, not the child's
         {child({"fds"}),
-         {"@STATUS=starting", "@READY=1", "?successfully started", "?child: ready", "!USR2",
-          "!TERM", "@STOPPING=1", "?child: sigterm", "?'test_child' exited with 0x0.",
-          "@STATUS=stopped", "!TERM", "=0", "-\x1b", "+child: fds clean", "-notify socket"}},
+         {"@STATUS=starting", running_1, "?successfully started", "?child: ready", "!USR2", "!TERM",
+          stopping_1, "?child: sigterm", "?'test_child' exited with 0x0.", "@STATUS=stopped",
+          "!TERM", "=0", "-\x1b", "+child: fds clean", "-notify socket"}},
         // a stop during the start: the first run returns at once, the second
         // still ends the child through its sigterm
         {child({"peer"}),
-         {"@STATUS=starting", "!TERM", "@READY=1", "@STOPPING=1", "?child: sigterm",
-          "@STATUS=stopped", "=0"}},
+         {"@STATUS=starting", "!TERM", running_1, stopping_1, "?child: sigterm", "@STATUS=stopped",
+          "=0"}},
         // a second stop request must not cut the children's end short
         {child({"ignore-sigterm"}),
-         {"@STATUS=starting", "@READY=1", "#ready pid", "!TERM", "@STOPPING=1",
+         {"@STATUS=starting", running_1, "#ready pid", "!TERM", stopping_1,
           "?child: sigterm ignored", "!TERM", "kill 9", "?'test_child' exited with 0x89.",
           "@STATUS=stopped", "=0", "-again"}},
+        // a persistent channel counts; the order of the two ends at the stop is open
+        {child({"execute", "1", child_binary, "peer"}),
+         {"@STATUS=starting", running_1, "@STATUS=running, 2 children", "!TERM",
+          "@STOPPING=1\nSTATUS=stopping, waiting for 2 children", "=0", "@*"}},
         {{},
-         {"@STATUS=starting", "?successfully started", "@READY=1", "@STOPPING=1",
-          "?stopping torvad", "@STATUS=stopped", "=0"}},
-        {child({"exit", "0"}),
-         {"@STATUS=starting", "@READY=1", "?exited with 0x0.", "@STOPPING=1", "@STATUS=stopped",
-          "=0"}},
-        {{"--", "no_such_program_xyz"},
-         {"@STATUS=starting", "?failed to start torvad", "@READY=1", "@STOPPING=1",
+         {"@STATUS=starting", "?successfully started", running_0, stopping_0, "?stopping torvad",
           "@STATUS=stopped", "=0"}},
+        {child({"exit", "0"}),
+         {"@STATUS=starting", running_1, "?exited with 0x0.", stopping_0, "@STATUS=stopped", "=0"}},
+        {{"--", "no_such_program_xyz"},
+         {"@STATUS=starting", "?failed to start torvad", running_0, stopping_0, "@STATUS=stopped",
+          "=0"}},
     };
     for (const auto& r : rows) {
         SCOPED_TRACE(::testing::PrintToString(r.args));
@@ -198,7 +175,8 @@ TEST(product, silent_core_hands_the_service_over_and_ends_with_1) {
         }
         std::string job = site.log("systemd-run");
         for (std::string part :
-             {"--on-active=10\n", "--uid=root\n", "/bin/sh\n-c\n",
+             {"--on-active=10\n", "--uid=root\n", "/bin/sh\n-c\n", "Type=exec\n",
+              "--description=hand the service over to core\n",
               "mkdir -p '/run/systemd/system/acmeServer.service.d'\n", "ExecStart=\n",
               "systemctl daemon-reload\n", "systemctl start torvaSentryServer\n"})
             EXPECT_NE(job.find(part), std::string::npos) << part << "\n" << job;

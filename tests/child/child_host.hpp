@@ -1,0 +1,26 @@
+// What the test child asks of its system, one small file for each
+// (child_posix.cpp, child_win32.cpp).
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <vector>
+
+namespace child_host {
+
+// Standard streams that carry bytes as they are (Windows would turn \n into \r\n).
+void prepare_streams();
+int own_pid();
+// Bytes read from standard input, 0 at its end, -1 on an error.
+long read_input(char* buffer, std::size_t size);
+// Writes all of data to standard output (1) or standard error (2).
+bool write_stream(int stream, const char* data, std::size_t size);
+// Lines on what the child was started with: the descriptors it holds beside
+// ipc_fd, its signals, its account, what of the environment it should not see.
+std::vector<std::string> start_state(int ipc_fd);
+// Leaves count processes behind whose parent has gone: each reports who
+// adopted it and ends when we do. False when that can't be done (on Windows
+// nothing adopts a process).
+bool leave_orphans(int count);
+
+} // namespace child_host

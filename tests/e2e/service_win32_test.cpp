@@ -1,0 +1,84 @@
+// The service path under the system's service control manager: created,
+// started, queried and stopped with sc.exe, the child ending through its
+// sigterm packet, as an installation runs torvad.
+#include <windows.h>
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <thread>
+
+#include "tests/e2e/harness.hpp"
+
+using namespace e2e;
+
+namespace {
+
+// Runs a tool of the system to its end; its output, both streams.
+std::string run_tool(std::string command) {
+    SECURITY_ATTRIBUTES inheritable{sizeof inheritable, nullptr, TRUE};
+    HANDLE ours = nullptr, theirs = nullptr;
+    if (!CreatePipe(&ours, &theirs, &inheritable, 0))
+        return "CreatePipe failed";
+    SetHandleInformation(ours, HANDLE_FLAG_INHERIT, 0);
+    STARTUPINFOA start{};
+    start.cb = sizeof start;
+    start.dwFlags = STARTF_USESTDHANDLES;
+    start.hStdOutput = start.hStdError = theirs;
+    PROCESS_INFORMATION started{};
+    bool ran = CreateProcessA(nullptr, command.data(), nullptr, nullptr, TRUE, 0, nullptr, nullptr,
+                              &start, &started);
+    CloseHandle(theirs);
+    std::string output = ran ? "" : "CreateProcessA failed";
+    char buffer[4096];
+    DWORD got = 0;
+    while (ran && ReadFile(ours, buffer, sizeof buffer, &got, nullptr) && got > 0)
+        output.append(buffer, got);
+    CloseHandle(ours);
+    if (ran) {
+        WaitForSingleObject(started.hProcess, INFINITE);
+        CloseHandle(started.hProcess);
+        CloseHandle(started.hThread);
+    }
+    return output;
+}
+
+// A bounded wait for what the manager or a file shows: they tell no event.
+bool becomes_true(const std::function<bool()>& condition) {
+    for (int tries = 0; tries < 100; ++tries) {
+        if (condition())
+            return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
+    return false;
+}
+
+} // namespace
+
+TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
+    scratch_dir dir;
+    std::string name = "torvad_test_" + std::to_string(GetCurrentProcessId());
+    std::string record = dir.path + "/child.log", pid_file = dir.path + "/pid";
+    std::string command = std::string("\\\"") + torvad_binary + "\\\" -p " + pid_file + " -d " +
+                          dir.path + " -- \\\"" + child_binary + "\\\" record " + record;
+    std::string created = run_tool("sc create " + name + " binpath= \"" + command + "\"");
+    ASSERT_NE(created.find("SUCCESS"), std::string::npos) << created;
+
+    run_tool("sc start " + name);
+    auto state_is = [&name](const char* state) {
+        return [&name, state] {
+            return run_tool("sc query " + name).find(state) != std::string::npos;
+        };
+    };
+    EXPECT_TRUE(becomes_true(state_is("RUNNING")));
+    EXPECT_TRUE(becomes_true([&] { return read_file(record).starts_with("version 1.1.21.0"); }))
+        << read_file(record);
+    EXPECT_TRUE(file_exists(pid_file));
+
+    run_tool("sc stop " + name);
+    EXPECT_TRUE(becomes_true(state_is("STOPPED")));
+    EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("sigterm\n"); }))
+        << read_file(record);
+    EXPECT_TRUE(becomes_true([&] { return !file_exists(pid_file); }));
+    run_tool("sc delete " + name);
+}
