@@ -83,6 +83,7 @@ bench: build
 	./build/bench/bench_execute
 	./build/bench/bench_relay
 	./build/bench/bench_memory
+	./build/bench/bench_scale
 
 format:
 	clang-format -i $$(git ls-files '*.cpp' '*.hpp')
