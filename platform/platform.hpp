@@ -92,7 +92,7 @@ struct launch_request {
     std::string working_directory; // empty: ours
     stdio_source stdio = stdio_source::inherit;
     int stdio_fds[3] = {-1, -1, -1}; // with stdio_source::descriptors
-    int ipc_fd = -1;                 // kept open in the child at the same number
+    int ipc_fd = -1;                 // the child has it at child_ipc_fd(ipc_fd)
     bool own_process_group = false;  // keeps a terminal's signals from the child
     account user;
 };
@@ -106,6 +106,10 @@ struct launch_result {
     launch_step failed_step = launch_step::none;
     os_error error;
 };
+
+// The number a launched child knows its end of the ipc pair by, for its last
+// argument: here always the first after its standard streams.
+int child_ipc_fd(int ipc_fd);
 
 // Launches the child. It keeps exactly fds 0, 1, 2 and ipc_fd, starts with
 // default signal dispositions, an empty mask and the environment without the

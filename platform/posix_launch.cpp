@@ -1,13 +1,17 @@
 // Launching, watching and ending children on Linux. A launch is one clone
 // that shares our memory and suspends us until the child has called exec or
 // given up (as posix_spawn does), with the pidfd made by the same call: no
-// status pipe, no race between the pid and its pidfd.
+// status pipe, no race between the pid and its pidfd. The child shares our
+// descriptor table too, and copies only its lowest few when it drops the
+// rest: a launch costs the same however many descriptors we hold.
 #include "platform/platform.hpp"
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstring>
 #include <fcntl.h>
+#include <linux/close_range.h>
 #include <sched.h>
 #include <sys/mman.h>
 #include <sys/syscall.h>
@@ -22,13 +26,18 @@ namespace torvad::platform {
 
 namespace {
 
+// A child's ipc end, the first number after its standard streams.
+constexpr int child_ipc_number = 3;
+
 // Everything the child needs, made before the clone, and the one place the
 // child writes back: its memory is ours until it calls exec.
 struct child_plan {
     const launch_request* request;
     char* const* argv;
     char* const* envp;
-    int null_fd;
+    int stdio_sources[3]; // what becomes the child's 0, 1 and 2
+    int ipc_source;       // what becomes its ipc end, or -1
+    int last_kept;        // the child copies our descriptors up to this one
     launch_step failed_step = launch_step::none;
     os_error error;
 };
@@ -63,28 +72,27 @@ void switch_account(child_plan& plan) {
         give_up(plan, launch_step::logon, "setuid");
 }
 
-void set_standard_descriptors(child_plan& plan) {
-    const launch_request& request = *plan.request;
+// Until the first call here our descriptor table is the child's too, and
+// nothing in it may change. The unsharing close copies only what lies below
+// the range it closes: the low numbers, where launch_child put what the child
+// keeps. Leaves open exactly 0, 1, 2 and the ipc end, at child_ipc_fd.
+void keep_own_descriptors(child_plan& plan) {
+    if (close_range(plan.last_kept + 1, ~0U, CLOSE_RANGE_UNSHARE) == -1)
+        give_up(plan, launch_step::create, "close_range");
     for (int target = 0; target < 3; ++target) {
-        int source = request.stdio == stdio_source::descriptors   ? request.stdio_fds[target]
-                     : request.stdio == stdio_source::null_device ? plan.null_fd
-                                                                  : target;
+        int source = plan.stdio_sources[target];
         if (source != target && dup2(source, target) == -1)
             give_up(plan, launch_step::create, "dup2");
     }
-}
-
-// Leaves open exactly 0, 1, 2 and the ipc end, whatever the fd limit was
-// when the others were opened.
-void close_other_descriptors(child_plan& plan) {
-    int ipc = plan.request->ipc_fd;
-    if (ipc > 2) {
-        if (ipc > 3 && close_range(3, ipc - 1, 0) == -1)
-            give_up(plan, launch_step::create, "close_range");
-        if (fcntl(ipc, F_SETFD, 0) == -1)
+    if (plan.ipc_source == child_ipc_number) {
+        // dup2 onto itself would leave close-on-exec set.
+        if (fcntl(child_ipc_number, F_SETFD, 0) == -1)
             give_up(plan, launch_step::create, "fcntl");
+    } else if (plan.ipc_source != -1 && dup2(plan.ipc_source, child_ipc_number) == -1) {
+        give_up(plan, launch_step::create, "dup2");
     }
-    if (close_range(ipc > 2 ? ipc + 1 : 3, ~0U, 0) == -1)
+    int first_closed = plan.ipc_source == -1 ? 3 : child_ipc_number + 1;
+    if (first_closed <= plan.last_kept && close_range(first_closed, plan.last_kept, 0) == -1)
         give_up(plan, launch_step::create, "close_range");
 }
 
@@ -99,8 +107,7 @@ int become_child(void* argument) {
         switch_account(plan);
     if (!request.working_directory.empty() && chdir(request.working_directory.c_str()) == -1)
         give_up(plan, launch_step::create, "chdir");
-    set_standard_descriptors(plan);
-    close_other_descriptors(plan);
+    keep_own_descriptors(plan);
     execve(request.executable.c_str(), plan.argv, plan.envp);
     give_up(plan, launch_step::create, "execve");
 }
@@ -139,8 +146,8 @@ launch_result clone_child(child_plan& plan) {
     // Noted before the guard goes: an orphan reap must never see it unnoted.
     std::lock_guard<std::mutex> lock(supervised_guard);
     int pidfd = -1;
-    pid_t pid =
-        clone(become_child, stack, CLONE_VM | CLONE_VFORK | CLONE_PIDFD | SIGCHLD, &plan, &pidfd);
+    pid_t pid = clone(become_child, stack,
+                      CLONE_VM | CLONE_FILES | CLONE_VFORK | CLONE_PIDFD | SIGCHLD, &plan, &pidfd);
     int clone_error = errno;
     pthread_sigmask(SIG_SETMASK, &saved, nullptr);
     if (pid == -1)
@@ -157,7 +164,92 @@ launch_result clone_child(child_plan& plan) {
     return {0, -1, plan.failed_step, plan.error};
 }
 
+// The low numbers where a launch puts what its child keeps, so that the child
+// need copy no more of our table than up to the last of them. They hold
+// /dev/null between launches, and null_fd always does. Taken on the first
+// launch, as low as were free then; launches come one at a time.
+struct low_slots {
+    int null_fd = -1;
+    int stdio[3] = {-1, -1, -1};
+    int ipc = -1;
+    int last = -1;
+};
+
+os_error reserve(low_slots& slots) {
+    if (slots.last != -1)
+        return {};
+    low_slots made;
+    made.null_fd = open("/dev/null", O_RDWR | O_CLOEXEC);
+    if (made.null_fd == -1)
+        return {errno, "open"};
+    made.last = made.null_fd;
+    for (int* slot : {&made.stdio[0], &made.stdio[1], &made.stdio[2], &made.ipc}) {
+        *slot = fcntl(made.null_fd, F_DUPFD_CLOEXEC, 3);
+        if (*slot == -1) {
+            os_error error{errno, "fcntl"};
+            for (int fd : {made.null_fd, made.stdio[0], made.stdio[1], made.stdio[2]})
+                close_descriptor(fd);
+            return error;
+        }
+        made.last = std::max(made.last, *slot);
+    }
+    slots = made;
+    return {};
+}
+
+// Puts the launch's descriptors into the slots and takes them out again: a
+// slot never holds a child's descriptor past its launch.
+class slot_filling {
+  public:
+    explicit slot_filling(const low_slots& slots) : slots_(slots) {}
+    ~slot_filling() {
+        for (int i = 0; i < filled_; ++i)
+            dup3(slots_.null_fd, used_[i], O_CLOEXEC);
+    }
+    slot_filling(const slot_filling&) = delete;
+    slot_filling& operator=(const slot_filling&) = delete;
+
+    os_error fill(int fd, int slot) {
+        if (dup3(fd, slot, O_CLOEXEC) == -1)
+            return {errno, "dup3"};
+        used_[filled_++] = slot;
+        return {};
+    }
+
+  private:
+    const low_slots& slots_;
+    int used_[4] = {};
+    int filled_ = 0;
+};
+
+low_slots slots;
+
+os_error place_descriptors(const launch_request& request, slot_filling& filling, child_plan& plan) {
+    for (int target = 0; target < 3; ++target) {
+        int& source = plan.stdio_sources[target];
+        source = request.stdio == stdio_source::descriptors   ? request.stdio_fds[target]
+                 : request.stdio == stdio_source::null_device ? slots.null_fd
+                                                              : target;
+        // Our own standard streams are low already.
+        if (request.stdio == stdio_source::descriptors && source > 2) {
+            if (os_error error = filling.fill(source, slots.stdio[target]))
+                return error;
+            source = slots.stdio[target];
+        }
+    }
+    if (request.ipc_fd != -1) {
+        if (os_error error = filling.fill(request.ipc_fd, slots.ipc))
+            return error;
+        plan.ipc_source = slots.ipc;
+    }
+    return {};
+}
+
 } // namespace
+
+int child_ipc_fd(int /*ipc_fd*/) {
+    return child_ipc_number;
+}
 
 launch_result launch_child(const launch_request& request) {
     static_assert(sizeof(unsigned) == sizeof(gid_t));
@@ -166,15 +258,14 @@ launch_result launch_child(const launch_request& request) {
         argv.push_back(const_cast<char*>(argument.c_str()));
     argv.push_back(nullptr);
     std::vector<char*> envp = child_environment();
-    child_plan plan{&request, argv.data(), envp.data(), -1, launch_step::none, {}};
-    if (request.stdio == stdio_source::null_device) {
-        plan.null_fd = open("/dev/null", O_RDWR | O_CLOEXEC);
-        if (plan.null_fd == -1)
-            return {0, -1, launch_step::create, {errno, "open"}};
-    }
-    launch_result result = clone_child(plan);
-    close_descriptor(plan.null_fd);
-    return result;
+    if (os_error error = reserve(slots))
+        return {0, -1, launch_step::create, error};
+    child_plan plan{&request, argv.data(), envp.data(),       {0, 1, 2},
+                    -1,       slots.last,  launch_step::none, {}};
+    slot_filling filling(slots);
+    if (os_error error = place_descriptors(request, filling, plan))
+        return {0, -1, launch_step::create, error};
+    return clone_child(plan);
 }
 
 exit_status reap_child(int pidfd) {

@@ -104,7 +104,7 @@ bool process::start() {
             owner->log_error("failed to create ipc pipe.");
             return fail_launch(error.code, error);
         }
-        argv.push_back(std::to_string(request.ipc_fd));
+        argv.push_back(std::to_string(platform::child_ipc_fd(request.ipc_fd)));
     }
     int logon_error = user.empty() ? 0 : platform::resolve_account(user, request.user);
     platform::launch_result launched;
