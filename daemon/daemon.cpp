@@ -106,17 +106,11 @@ void daemon::on_signal(const boost::system::error_code& error, int /*signal_numb
 }
 
 bool daemon::any_persistent() const {
-    for (const auto& child : children_)
-        if (child->persistent)
-            return true;
-    return false;
+    return persistent_children_ != 0;
 }
 
 std::size_t daemon::persistent_count() const {
-    std::size_t count = 0;
-    for (const auto& child : children_)
-        count += child->persistent;
-    return count;
+    return persistent_children_;
 }
 
 // One report per turn of the loop at most: a restart adds the successor and
@@ -146,18 +140,21 @@ void daemon::run() {
 }
 
 void daemon::adopt(std::shared_ptr<process> child) {
-    if (child->persistent)
+    if (child->persistent) {
+        ++persistent_children_;
         persistent_children_changed();
+    }
     children_.insert(std::move(child));
 }
 
 void daemon::remove(const std::shared_ptr<process>& child) {
-    for (const auto& member : children_)
-        if (member->parent.lock() == child)
-            member->close_pipes();
-    children_.erase(child);
-    if (child->persistent)
+    // Each process knows its channels: an end costs the same however many
+    // children there are.
+    child->close_channel_pipes();
+    if (children_.erase(child) != 0 && child->persistent) {
+        --persistent_children_;
         persistent_children_changed();
+    }
     if (!any_persistent())
         io_context::stop();
 }

@@ -85,6 +85,7 @@ class daemon : public boost::asio::io_context {
     std::string service_name_;
     std::string program_name_;
     std::unordered_set<std::shared_ptr<process>> children_;
+    std::size_t persistent_children_ = 0; // kept with children_, so never counted
     boost::asio::signal_set signals_;
     boost::asio::posix::stream_descriptor orphan_watch_;
     pattern_lists patterns_;

@@ -49,6 +49,11 @@ void process::close_pipes() {
     }
 }
 
+void process::close_channel_pipes() {
+    for (process* own : own_channels)
+        own->close_pipes();
+}
+
 void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     end_packet = end;
     status = exit_status;

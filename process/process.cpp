@@ -22,6 +22,8 @@ process::process(daemon* owner, std::vector<std::string> command, std::string us
         this->stdio_mode = stdio_none;
     if (!this->command.empty())
         name = boost::filesystem::path(this->command[0]).filename().string();
+    if (auto requester = parent.lock())
+        requester->own_channels.insert(this);
 }
 
 std::shared_ptr<process> process::create(daemon* owner, std::vector<std::string> command,
@@ -43,6 +45,7 @@ process::~process() {
     if (auto requester = parent.lock()) {
         requester->send_packet(channel, end_packet, status, nullptr, 0);
         requester->channels.erase(channel);
+        requester->own_channels.erase(this);
     }
 }
 

@@ -20,6 +20,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <unordered_set>
 #include <vector>
 
 #include <boost/asio/io_context.hpp>
@@ -65,6 +66,8 @@ class process : public std::enable_shared_from_this<process> {
     // Asks a persistent child to stop with sigterm, ends any other by force.
     void terminate();
     void close_pipes();
+    // close_pipes on every channel of this process, a restarted one included.
+    void close_channel_pipes();
 
     daemon* const owner;
     const std::vector<std::string> command;
@@ -139,6 +142,11 @@ class process : public std::enable_shared_from_this<process> {
     bool ipc_writing = false;
     bool ipc_read_paused = false; // a channel's stdin backlog holds the reads back
     std::map<std::uint32_t, std::weak_ptr<process>> channels;
+    // Every process made as a channel of this one and not yet destroyed: a
+    // restarted channel has left `channels` at its predecessor's end, but is
+    // still ours. Each enters in its constructor and leaves in its destructor,
+    // so a plain pointer here is always to a living object.
+    std::unordered_set<process*> own_channels;
     std::vector<std::weak_ptr<process>> waiting_for_room; // channels paused on our queue
 };
 
