@@ -64,6 +64,7 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     exit_watch.close(ignored);
     stdin_close_requested = false;
     stdin_queue.clear();
+    count_stdin_backlog();
     ipc_queue.clear();
     channels.clear();
     // A requester held back by our stdin backlog may read again.

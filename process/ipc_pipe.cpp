@@ -72,11 +72,8 @@ void process::on_ipc_read(const boost::system::error_code& error, std::size_t by
 }
 
 void process::resume_ipc_read() {
-    if (!ipc_read_paused || !ipc_pipe.is_open())
+    if (!ipc_read_paused || !ipc_pipe.is_open() || backlogged_channels != 0)
         return;
-    for (const auto& [id, weak] : channels)
-        if (auto target = weak.lock(); target && target->stdin_backlogged())
-            return;
     ipc_read_paused = false;
     read_ipc();
 }
@@ -142,9 +139,6 @@ bool process::ipc_backlogged() const {
 }
 
 void process::wait_for_room(const std::shared_ptr<process>& writer) {
-    for (const auto& weak : waiting_for_room)
-        if (weak.lock() == writer)
-            return;
     waiting_for_room.push_back(writer);
 }
 

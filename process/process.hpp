@@ -102,6 +102,7 @@ class process : public std::enable_shared_from_this<process> {
     void write_stdin(const char* data, std::uint32_t size, bool close);
     void pump_stdin();
     bool stdin_backlogged() const;
+    void count_stdin_backlog();
 
     // the ipc pipe (process/ipc_pipe.cpp)
     platform::os_error create_ipc_pipe(int& theirs);
@@ -134,6 +135,7 @@ class process : public std::enable_shared_from_this<process> {
     byte_queue stdin_queue;
     bool stdin_writing = false;
     bool stdin_close_requested = false;
+    bool stdin_counted = false;                    // in the requester's backlogged_channels
     bool output_paused[3] = {false, false, false}; // by stream number, 1 and 2
 
     descriptor ipc_pipe;
@@ -148,6 +150,7 @@ class process : public std::enable_shared_from_this<process> {
     // so a plain pointer here is always to a living object.
     std::unordered_set<process*> own_channels;
     std::vector<std::weak_ptr<process>> waiting_for_room; // channels paused on our queue
+    std::size_t backlogged_channels = 0;                  // channels whose stdin is over its mark
 };
 
 } // namespace torvad

@@ -48,8 +48,10 @@ void process::relay_output(int stream) {
     auto requester = parent.lock();
     for (int reads = 0; reads < relay_reads_per_wake; ++reads) {
         if (requester && requester->ipc_backlogged()) {
+            // A channel paused on its other stream waits in the list already.
+            if (!output_paused[1] && !output_paused[2])
+                requester->wait_for_room(shared_from_this());
             output_paused[stream] = true;
-            requester->wait_for_room(shared_from_this());
             return;
         }
         boost::system::error_code error = forward_output(stream, requester.get());
@@ -62,12 +64,13 @@ void process::relay_output(int stream) {
 }
 
 void process::resume_output() {
-    for (int stream : {1, 2}) {
-        if (output_paused[stream]) {
-            output_paused[stream] = false;
+    // Both flags go first: a stream that pauses again must find itself out of
+    // the requester's list, and put itself back.
+    bool paused[3] = {false, output_paused[1], output_paused[2]};
+    output_paused[1] = output_paused[2] = false;
+    for (int stream : {1, 2})
+        if (paused[stream])
             relay_output(stream);
-        }
-    }
 }
 
 // The child is gone, so what is in its pipes is all there will be from it;
@@ -87,6 +90,7 @@ void process::write_stdin(const char* data, std::uint32_t size, bool close) {
     if (!stdin_pipe.is_open())
         return;
     stdin_queue.push(data, size);
+    count_stdin_backlog();
     stdin_close_requested = stdin_close_requested || close;
     // A write in flight drains the queue by itself, a requested close included.
     if (!stdin_writing)
@@ -118,6 +122,7 @@ void process::pump_stdin() {
                                         stdin_queue.clear();
                                     }
                                     stdin_queue.consume(n);
+                                    count_stdin_backlog();
                                     pump_stdin();
                                     if (stdin_queue.size() < stdin_low_mark)
                                         if (auto requester = parent.lock())
@@ -127,6 +132,16 @@ void process::pump_stdin() {
 
 bool process::stdin_backlogged() const {
     return stdin_queue.size() >= stdin_high_mark;
+}
+
+// The requester counts its channels over the mark as their queues cross it,
+// so that whether it may read costs the same however many channels it has.
+void process::count_stdin_backlog() {
+    if (stdin_backlogged() == stdin_counted)
+        return;
+    stdin_counted = !stdin_counted;
+    if (auto requester = parent.lock())
+        requester->backlogged_channels += stdin_counted ? 1 : -1;
 }
 
 } // namespace torvad
