@@ -4,6 +4,7 @@
 // such orphan, and leave the status of our own children to their pidfds.
 #include "platform/platform.hpp"
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <sys/prctl.h>
@@ -19,10 +20,52 @@ std::mutex supervised_guard;
 
 namespace {
 std::unordered_set<int> supervised;
+
+// A scan for ended orphans walks all our children in the kernel, so it can't
+// follow every supervised child's end. A signal that names an orphan, or
+// comes while we have few children, is scanned for at once. Otherwise the
+// scan waits until one in scan_share of the supervised children has ended
+// since the last: an orphan that ended with one of them, its signal merged
+// into theirs, waits that long, and an end costs the same however many
+// children we have.
+constexpr std::size_t scan_share = 64;
+bool watching = false;
+bool scan_owed = false; // stays until a scan has seen no ended orphan
+// Supervised children reaped since the last scan, whose signal may come after
+// their exit wait has taken their status; and the signals that named them.
+std::unordered_set<int> reaped;
+std::size_t supervised_signals = 0;
+
+// Drains the pending signals and says whether a scan is due.
+bool scan_due(int fd) {
+    signalfd_siginfo pending[8];
+    ssize_t got;
+    while ((got = read(fd, pending, sizeof pending)) > 0) {
+        for (std::size_t i = 0; i < static_cast<std::size_t>(got) / sizeof pending[0]; ++i) {
+            int pid = static_cast<int>(pending[i].ssi_pid);
+            if (supervised.count(pid) != 0 || reaped.count(pid) != 0)
+                ++supervised_signals;
+            else
+                scan_owed = true;
+        }
+    }
+    // Merged signals undercount the ends, and reaps come late: the larger.
+    std::size_t ends = std::max(supervised_signals, reaped.size());
+    if (ends != 0 && ends * scan_share >= supervised.size())
+        scan_owed = true;
+    return scan_owed;
+}
+
+void scan_done() {
+    scan_owed = false;
+    reaped.clear();
+    supervised_signals = 0;
+}
 } // namespace
 
 void note_supervised(int pid) {
     supervised.insert(pid);
+    reaped.erase(pid);
 }
 
 int wait_supervised(int pidfd, siginfo_t& info, int options) {
@@ -33,6 +76,8 @@ int wait_supervised(int pidfd, siginfo_t& info, int options) {
     if (waited == 0 && info.si_pid != 0) {
         std::lock_guard<std::mutex> lock(supervised_guard);
         supervised.erase(info.si_pid);
+        if (watching)
+            reaped.insert(info.si_pid);
     }
     return waited;
 }
@@ -50,28 +95,32 @@ os_error watch_orphans(int& fd) {
     if (int error = pthread_sigmask(SIG_BLOCK, &child_ended, nullptr))
         return {error, "pthread_sigmask"};
     fd = signalfd(-1, &child_ended, SFD_NONBLOCK | SFD_CLOEXEC);
-    return fd == -1 ? os_error{errno, "signalfd"} : os_error{};
+    if (fd == -1)
+        return {errno, "signalfd"};
+    watching = true;
+    return {};
 }
 
 bool reap_orphans(int fd) {
-    // One pending signal stands for any number of ends; the scan below finds them.
-    signalfd_siginfo pending[8];
-    while (read(fd, pending, sizeof pending) > 0) {
-    }
     std::lock_guard<std::mutex> lock(supervised_guard);
+    // One pending signal stands for any number of ends; the scan below finds them.
+    if (!scan_due(fd))
+        return true;
     for (;;) {
         // A peek leaves the child as it is; only an orphan is then reaped.
         siginfo_t ended{};
         if (waitid(P_ALL, 0, &ended, WEXITED | WNOHANG | WNOWAIT) == -1 && errno == EINTR)
             continue;
-        if (ended.si_pid == 0)
-            return true; // none has ended, or we have no child at all
+        if (ended.si_pid == 0) {
+            scan_done(); // none has ended, or we have no child at all
+            return true;
+        }
         // The peek shows one ended child only, and the same one until it is
         // reaped: the rest can be seen once this one's pidfd has served.
         if (supervised.count(ended.si_pid) != 0)
             return false;
-        siginfo_t reaped{};
-        while (waitid(P_PID, static_cast<id_t>(ended.si_pid), &reaped, WEXITED | WNOHANG) == -1 &&
+        siginfo_t taken{};
+        while (waitid(P_PID, static_cast<id_t>(ended.si_pid), &taken, WEXITED | WNOHANG) == -1 &&
                errno == EINTR) {
         }
     }
