@@ -71,6 +71,10 @@ void remove_file(const std::string& path) {
 }
 
 std::string absolute_path(const std::string& path, os_error& error) {
+    boost::filesystem::path given(path);
+    // Only a relative path needs the current directory, a system call.
+    if (given.is_absolute())
+        return given.lexically_normal().string();
     boost::system::error_code failure;
     auto directory = boost::filesystem::current_path(failure);
     if (failure) {

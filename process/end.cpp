@@ -57,6 +57,16 @@ void process::close_channel_pipes() {
 void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     end_packet = end;
     status = exit_status;
+    if (end_packet == packet_closed) {
+        if (status == 0)
+            owner->log_info("'%s' exited with 0x%x.", name.c_str(), status);
+        else
+            owner->log_warning("'%s' exited with 0x%x.", name.c_str(), status);
+        // The successor first: nothing below concerns it, and the time from
+        // an exit to the next start is what a restart costs.
+        if (status != 0 && auto_restart && persistent)
+            restart();
+    }
     // Closing ends the pending reads and writes before their queues go.
     close_pipes();
     boost::system::error_code ignored;
@@ -70,14 +80,6 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     // A requester held back by our stdin backlog may read again.
     if (auto requester = parent.lock())
         requester->resume_ipc_read();
-    if (end_packet == packet_closed) {
-        if (status == 0)
-            owner->log_info("'%s' exited with 0x%x.", name.c_str(), status);
-        else
-            owner->log_warning("'%s' exited with 0x%x.", name.c_str(), status);
-        if (status != 0 && auto_restart && persistent)
-            restart();
-    }
     // Completions that were already queued when the pipes closed still run and
     // may hold a plain pointer to us; this handler, queued behind them, keeps
     // the object alive until they have.
