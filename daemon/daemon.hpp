@@ -42,6 +42,18 @@ class daemon : public boost::asio::io_context {
     void log_verbose(const char* format, ...) __attribute__((format(printf, 2, 3)));
     bool colour() const { return colour_; }
     void set_colour(bool colour) { colour_ = colour; }
+    // Console lines logged while a hold lives wait, and go out in one write
+    // when the last hold ends: a child's exit line and its restart line, say.
+    class console_hold {
+      public:
+        explicit console_hold(daemon& owner) : owner_(owner) { ++owner_.console_holds_; }
+        ~console_hold();
+        console_hold(const console_hold&) = delete;
+        console_hold& operator=(const console_hold&) = delete;
+
+      private:
+        daemon& owner_;
+    };
 
     // Names the service, loads the patterns (none: everything is allowed for
     // the child's own account) and arms the stop-signal wait. Called once.
@@ -82,6 +94,8 @@ class daemon : public boost::asio::io_context {
     void reap_orphans();
 
     bool colour_;
+    int console_holds_ = 0;
+    std::string held_lines_;
     std::string service_name_;
     std::string program_name_;
     std::unordered_set<std::shared_ptr<process>> children_;

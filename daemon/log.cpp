@@ -8,6 +8,8 @@ namespace torvad {
 
 namespace {
 constexpr std::size_t log_buffer_size = 4096;
+// The time, the name and the colours around the text.
+constexpr std::size_t line_frame_size = 64;
 // Colour numbers of the console line: the second digit of an ANSI foreground.
 enum level_colour : int { colour_red = 1, colour_green = 2, colour_yellow = 3 };
 } // namespace
@@ -17,13 +19,27 @@ void daemon::log_line(event_type type, int colour_number, const char* format, va
     char text[log_buffer_size];
     std::vsnprintf(text, sizeof text, format, args);
     std::tm now = platform::local_time_now();
+    char line[log_buffer_size + line_frame_size];
     if (colour_)
-        std::printf("\x1b[3%dm%02d:%02d:%02d\x1b[36m torvad\x1b[0m %s\n", colour_number,
-                    now.tm_hour, now.tm_min, now.tm_sec, text);
+        std::snprintf(line, sizeof line, "\x1b[3%dm%02d:%02d:%02d\x1b[36m torvad\x1b[0m %s\n",
+                      colour_number, now.tm_hour, now.tm_min, now.tm_sec, text);
     else
-        std::printf("%02d:%02d:%02d torvad %s\n", now.tm_hour, now.tm_min, now.tm_sec, text);
+        std::snprintf(line, sizeof line, "%02d:%02d:%02d torvad %s\n", now.tm_hour, now.tm_min,
+                      now.tm_sec, text);
+    // stdout is line-buffered: one call, one write.
+    if (console_holds_ == 0)
+        std::fputs(line, stdout);
+    else
+        held_lines_ += line;
     if (logging)
         platform::write_event_record(type, text);
+}
+
+daemon::console_hold::~console_hold() {
+    if (--owner_.console_holds_ != 0)
+        return;
+    std::fputs(owner_.held_lines_.c_str(), stdout);
+    owner_.held_lines_.clear();
 }
 
 void daemon::log_error(const char* format, ...) {

@@ -58,13 +58,20 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     end_packet = end;
     status = exit_status;
     if (end_packet == packet_closed) {
-        if (status == 0)
-            owner->log_info("'%s' exited with 0x%x.", name.c_str(), status);
-        else
-            owner->log_warning("'%s' exited with 0x%x.", name.c_str(), status);
+        bool again = status != 0 && auto_restart && persistent;
+        {
+            // Both lines in one console write, and both ahead of the launch.
+            daemon::console_hold lines(*owner);
+            if (status == 0)
+                owner->log_info("'%s' exited with 0x%x.", name.c_str(), status);
+            else
+                owner->log_warning("'%s' exited with 0x%x.", name.c_str(), status);
+            if (again)
+                owner->log_info("starting '%s' again.", name.c_str());
+        }
         // The successor first: nothing below concerns it, and the time from
         // an exit to the next start is what a restart costs.
-        if (status != 0 && auto_restart && persistent)
+        if (again)
             restart();
     }
     // Closing ends the pending reads and writes before their queues go.
@@ -89,7 +96,6 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
 }
 
 void process::restart() {
-    owner->log_info("starting '%s' again.", name.c_str());
     // The successor is in children before we leave, so the run never looks
     // empty across a restart.
     create(owner, command, user, working_directory, {parent, channel}, persistent, stdio_mode)
