@@ -11,7 +11,10 @@ namespace torvad {
 char* byte_queue::room(std::size_t& available) {
     if (blocks_.empty() || blocks_.back().end == block_size) {
         block fresh;
-        fresh.data = spare_ ? std::move(spare_) : std::make_unique<char[]>(block_size);
+        // Not zeroed: every byte is written before it is read, and a block
+        // touches only the pages that a queue fills.
+        fresh.data =
+            spare_ ? std::move(spare_) : std::make_unique_for_overwrite<char[]>(block_size);
         blocks_.push_back(std::move(fresh));
     }
     block& last = blocks_.back();
