@@ -29,8 +29,13 @@ void daemon::wait_for_orphans() {
                              [this](const boost::system::error_code& error) {
                                  if (error)
                                      return;
-                                 reap_orphans();
-                                 wait_for_orphans();
+                                 // Behind what is ready already: a supervised
+                                 // child's end, and its restart, need not
+                                 // wait for a scan of the others.
+                                 boost::asio::post(*this, [this] {
+                                     reap_orphans();
+                                     wait_for_orphans();
+                                 });
                              });
 }
 
