@@ -176,6 +176,24 @@ int mode_spawn_once(const context& how) {
     return 3;
 }
 
+// The first time (no MARKER yet): has ITEMS run on channel 1 with FLAGS,
+// waits for OPENS opened packets and exits 3, leaving the channel behind;
+// then, started again, serves.
+//   leave-channel MARKER OPENS FLAGS ITEMS...
+int mode_leave_channel(const context& how) {
+    if (how.args.size() < 4 || !create_once(how.args[0]))
+        return serve(how, true);
+    connection link(how.ipc_fd);
+    greet(link);
+    link.execute(1, static_cast<std::uint32_t>(how.number(2)),
+                 {how.args.begin() + 3, how.args.end()});
+    peer::packet packet;
+    for (int opened = 0; opened < how.number(1) && link.receive(packet);)
+        opened += packet.header.type == packet_opened;
+    say("left");
+    return 3;
+}
+
 // Runs "echo" as a channel with relayed streams and checks what comes back:
 // opened first, output in order and in pieces of 4096 at most, closed last.
 int mode_relay(const context& how) {
@@ -329,6 +347,7 @@ const mode modes[] = {
     {"raw", mode_raw},
     {"close-ipc", mode_close_ipc},
     {"spawn-once", mode_spawn_once},
+    {"leave-channel", mode_leave_channel},
     {"relay", mode_relay},
     {"execute", mode_execute},
     {"write", mode_write},

@@ -87,6 +87,34 @@ TEST(children, a_channel_relays_its_standard_streams_in_order) {
                                     "?child: relay ok", "!INT", "=0"});
 }
 
+// When a requester ends, its channels lose their pipes and run on: a cat
+// there sees the end of its input and ends. So does one that was restarted,
+// though its id left the requester when its predecessor closed.
+TEST(children, a_requester_s_end_closes_the_pipes_of_its_channels) {
+    if (!holds_here(systems::linux_only))
+        GTEST_SKIP() << "runs cat and sh";
+    scratch_dir dir;
+    std::string once = "test -e " + dir.path + "/sh || { touch " + dir.path + "/sh; exit 3; }";
+    const std::vector<std::string> rows[] = {
+        // pipes
+        {"1", "2", "cat", "?'cat' exited with 0x0."},
+        // persistent and pipes, restarted once
+        {"2", "3", "sh", "-c", once + "; exec cat", "+starting 'sh' again.",
+         "?'sh' exited with 0x0."},
+    };
+    for (const auto& r : rows) {
+        SCOPED_TRACE(::testing::PrintToString(r));
+        auto end = std::find_if(r.begin(), r.end(),
+                                [](const auto& s) { return s[0] == '?' || s[0] == '+'; });
+        std::vector<std::string> mode = {"leave-channel", dir.path + "/left-" + r[2]};
+        mode.insert(mode.end(), r.begin(), end);
+        std::vector<std::string> steps = {"?child: left", "?starting 'test_child' again."};
+        steps.insert(steps.end(), end, r.end());
+        steps.insert(steps.end(), {"!INT", "=0"});
+        run_scenario(child(mode), steps);
+    }
+}
+
 // A channel outlives its requester; at the stop it has no living parent, so
 // it is ended by force and that end counts as 0. The requester ignores
 // sigterm, so the run lasts until that end is seen.
