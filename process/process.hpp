@@ -4,8 +4,8 @@
 // Who keeps a process alive:
 // - The daemon's set of children owns it, from create() to daemon::remove().
 // - Each pending read (of the ipc pipe, or a wait for a relayed output pipe)
-//   holds shared_from_this(): the closing packet of a channel, sent by the
-//   destructor, can only follow output that was already read.
+//   holds shared_from_this(). finish() takes what the output pipes still
+//   hold and sends a channel's closing packet in the same turn.
 // - The exit wait and the writes hold a plain pointer and act only on
 //   success: they must not keep the object alive, and they can't complete
 //   successfully once finish() has closed their descriptor.
@@ -47,6 +47,10 @@ using descriptor =
 // Takes fd into object, non-blocking; on failure fd is still the caller's.
 platform::os_error own_descriptor(descriptor& object, int fd);
 
+// The code a reaped child's end counts as: its exit status, 128 + the signal
+// of a death by signal (0 when we forced it), and 0 when it can't be read.
+std::uint32_t exit_code_of(const platform::exit_status& exit, bool forced);
+
 class process : public std::enable_shared_from_this<process> {
   public:
     static std::shared_ptr<process> create(daemon* owner, std::vector<std::string> command,
@@ -65,6 +69,8 @@ class process : public std::enable_shared_from_this<process> {
     // Asks a persistent child to stop with sigterm, ends any other by force.
     void terminate();
     void close_pipes();
+    // "'name' (pid N)", for a log line.
+    std::string description() const;
 
     daemon* const owner;
     const std::vector<std::string> command;
@@ -88,6 +94,8 @@ class process : public std::enable_shared_from_this<process> {
     // end (process/end.cpp)
     void on_exit(const boost::system::error_code& error);
     void finish(std::uint32_t status, std::uint32_t end_packet);
+    // Sends the parent end_packet with status and frees the channel id, once.
+    void report_end();
     void restart();
 
     // relayed standard streams (process/streams.cpp)
@@ -124,7 +132,8 @@ class process : public std::enable_shared_from_this<process> {
     std::uint32_t pid = 0;
     std::uint32_t end_packet;
     std::uint32_t status = 0;
-    bool forced = false;   // terminate ended the child by force: its end counts as 0
+    bool forced = false; // terminate ended the child by force: its end counts as 0
+    bool end_reported = false;
     descriptor exit_watch; // the child's pidfd
 
     descriptor stdin_pipe, stdout_pipe, stderr_pipe; // our ends of the relayed streams
