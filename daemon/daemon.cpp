@@ -18,7 +18,8 @@ bool auto_restart = true;
 const char* const daemon_version = "1.1.21.0";
 
 daemon::daemon()
-    : colour_(platform::stdout_is_terminal()), signals_(*this, SIGINT), orphan_watch_(*this) {}
+    : colour_(platform::console_takes_colour()), signals_(*this, SIGINT),
+      orphan_watch_(get_executor()) {}
 
 daemon::~daemon() {
     // Children go first, while the loop's services still exist for the

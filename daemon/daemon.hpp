@@ -9,7 +9,6 @@
 #include <unordered_set>
 
 #include <boost/asio/io_context.hpp>
-#include <boost/asio/posix/stream_descriptor.hpp>
 #include <boost/asio/signal_set.hpp>
 
 #include "ipc/patterns.hpp"
@@ -87,7 +86,7 @@ class daemon : public boost::asio::io_context {
     std::string program_name_;
     std::unordered_set<std::shared_ptr<process>> children_;
     boost::asio::signal_set signals_;
-    boost::asio::posix::stream_descriptor orphan_watch_;
+    platform::stream orphan_watch_;
     pattern_lists patterns_;
     bool children_report_posted_ = false;
     bool stop_requested_ = false;

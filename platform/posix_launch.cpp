@@ -26,6 +26,7 @@ namespace {
 // child writes back: its memory is ours until it calls exec.
 struct child_plan {
     const launch_request* request;
+    const account* user;
     char* const* argv;
     char* const* envp;
     int null_fd;
@@ -54,7 +55,7 @@ void reset_signals() {
 // The raw system calls: glibc's wrappers of these would signal every thread
 // of the process whose memory we share.
 void switch_account(child_plan& plan) {
-    const account& user = plan.request->user;
+    const account& user = *plan.user;
     if (syscall(SYS_setgroups, user.groups.size(), user.groups.data()) == -1)
         give_up(plan, launch_step::logon, "setgroups");
     if (syscall(SYS_setgid, user.gid) == -1)
@@ -66,9 +67,9 @@ void switch_account(child_plan& plan) {
 void set_standard_descriptors(child_plan& plan) {
     const launch_request& request = *plan.request;
     for (int target = 0; target < 3; ++target) {
-        int source = request.stdio == stdio_source::descriptors   ? request.stdio_fds[target]
-                     : request.stdio == stdio_source::null_device ? plan.null_fd
-                                                                  : target;
+        int source = request.stdio == stdio_source::handles ? request.stdio_handles[target]
+                     : request.stdio == stdio_source::none  ? plan.null_fd
+                                                            : target;
         if (source != target && dup2(source, target) == -1)
             give_up(plan, launch_step::create, "dup2");
     }
@@ -77,7 +78,7 @@ void set_standard_descriptors(child_plan& plan) {
 // Leaves open exactly 0, 1, 2 and the ipc end, whatever the fd limit was
 // when the others were opened.
 void close_other_descriptors(child_plan& plan) {
-    int ipc = plan.request->ipc_fd;
+    int ipc = plan.request->ipc;
     if (ipc > 2) {
         if (ipc > 3 && close_range(3, ipc - 1, 0) == -1)
             give_up(plan, launch_step::create, "close_range");
@@ -95,7 +96,7 @@ int become_child(void* argument) {
     reset_signals();
     if (request.own_process_group && setpgid(0, 0) == -1)
         give_up(plan, launch_step::create, "setpgid");
-    if (request.user.change)
+    if (plan.user->change)
         switch_account(plan);
     if (!request.working_directory.empty() && chdir(request.working_directory.c_str()) == -1)
         give_up(plan, launch_step::create, "chdir");
@@ -129,10 +130,17 @@ std::vector<char*> child_environment() {
 
 // Clones with every signal blocked, so that no handler of ours runs in the
 // child before it has reset them; our own mask comes back after.
+launch_result failed_launch(launch_step step, os_error error) {
+    launch_result result;
+    result.failed_step = step;
+    result.error = error;
+    return result;
+}
+
 launch_result clone_child(child_plan& plan) {
     char* stack = child_stack_top();
     if (stack == nullptr)
-        return {0, -1, launch_step::create, {ENOMEM, "mmap"}};
+        return failed_launch(launch_step::create, {ENOMEM, "mmap"});
     sigset_t all, saved;
     sigfillset(&all);
     pthread_sigmask(SIG_SETMASK, &all, &saved);
@@ -144,57 +152,84 @@ launch_result clone_child(child_plan& plan) {
     int clone_error = errno;
     pthread_sigmask(SIG_SETMASK, &saved, nullptr);
     if (pid == -1)
-        return {0, -1, launch_step::create, {clone_error, "clone"}};
+        return failed_launch(launch_step::create, {clone_error, "clone"});
     if (plan.failed_step == launch_step::none) {
         note_supervised(static_cast<int>(pid));
-        return {static_cast<int>(pid), pidfd, launch_step::none, {}};
+        launch_result result;
+        result.pid = static_cast<int>(pid);
+        result.process.reset(pidfd);
+        return result;
     }
     // It has called _exit already; reap it so that no zombie stays behind.
     // Its pid was never noted, and the guard we hold keeps it from the orphans.
     siginfo_t info{};
     waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED);
     close(pidfd);
-    return {0, -1, plan.failed_step, plan.error};
+    return failed_launch(plan.failed_step, plan.error);
 }
 
 } // namespace
 
 launch_result launch_child(const launch_request& request) {
     static_assert(sizeof(unsigned) == sizeof(gid_t));
+    account user;
+    if (!request.user.empty())
+        if (int refused = resolve_account(request.user, user))
+            return failed_launch(launch_step::logon, {refused, "resolve account"});
     std::vector<char*> argv;
     for (const auto& argument : request.argv)
         argv.push_back(const_cast<char*>(argument.c_str()));
     argv.push_back(nullptr);
     std::vector<char*> envp = child_environment();
-    child_plan plan{&request, argv.data(), envp.data(), -1, launch_step::none, {}};
-    if (request.stdio == stdio_source::null_device) {
+    child_plan plan{&request, &user, argv.data(), envp.data(), -1, launch_step::none, {}};
+    if (request.stdio == stdio_source::none) {
         plan.null_fd = open("/dev/null", O_RDWR | O_CLOEXEC);
         if (plan.null_fd == -1)
-            return {0, -1, launch_step::create, {errno, "open"}};
+            return failed_launch(launch_step::create, {errno, "open"});
     }
     launch_result result = clone_child(plan);
-    close_descriptor(plan.null_fd);
+    if (plan.null_fd != -1)
+        close(plan.null_fd);
     return result;
 }
 
-exit_status reap_child(int pidfd) {
+os_error watch_exit(exit_watch& watch, owned_handle& process) {
+    boost::system::error_code failure;
+    watch.assign(process.get(), failure);
+    if (failure)
+        return {failure.value(), "assign"};
+    process.release();
+    return {};
+}
+
+void await_exit(exit_watch& watch, ready_handler handler) {
+    watch.async_wait(exit_watch::wait_read, std::move(handler));
+}
+
+exit_status exit_status_of(exit_watch& watch) {
     siginfo_t info{};
-    if (wait_supervised(pidfd, info, WEXITED | WNOHANG) == -1)
+    if (wait_supervised(watch.native_handle(), info, WEXITED | WNOHANG) == -1)
         return {true, false, 0, {errno, "waitid"}};
     if (info.si_pid == 0)
         return {};
     return {true, info.si_code == CLD_EXITED, info.si_status, {}};
 }
 
+namespace {
 void kill_child(int pidfd) {
     syscall(SYS_pidfd_send_signal, pidfd, SIGKILL, nullptr, 0);
 }
+} // namespace
 
-void end_child_now(int pidfd) {
-    kill_child(pidfd);
+void end_by_force(exit_watch& watch) {
+    kill_child(watch.native_handle());
+}
+
+void end_now(owned_handle& process) {
+    kill_child(process.get());
     siginfo_t info{};
-    wait_supervised(pidfd, info, WEXITED);
-    close(pidfd);
+    wait_supervised(process.get(), info, WEXITED);
+    process.reset();
 }
 
 } // namespace torvad::platform

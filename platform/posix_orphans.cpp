@@ -37,8 +37,7 @@ int wait_supervised(int pidfd, siginfo_t& info, int options) {
     return waited;
 }
 
-os_error watch_orphans(int& fd) {
-    fd = -1;
+os_error watch_orphans(stream& watch) {
     // The first process of a PID namespace is the reaper there already.
     if (getpid() != 1 && prctl(PR_SET_CHILD_SUBREAPER, 1) == -1)
         return {errno, "prctl"};
@@ -49,14 +48,25 @@ os_error watch_orphans(int& fd) {
     // descriptor and interrupts no call. Children start with an empty mask.
     if (int error = pthread_sigmask(SIG_BLOCK, &child_ended, nullptr))
         return {error, "pthread_sigmask"};
-    fd = signalfd(-1, &child_ended, SFD_NONBLOCK | SFD_CLOEXEC);
-    return fd == -1 ? os_error{errno, "signalfd"} : os_error{};
+    owned_handle fd(signalfd(-1, &child_ended, SFD_NONBLOCK | SFD_CLOEXEC));
+    if (!fd.valid())
+        return {errno, "signalfd"};
+    boost::system::error_code failure;
+    watch.assign(fd.get(), failure);
+    if (failure)
+        return {failure.value(), "assign"};
+    fd.release();
+    return {};
 }
 
-bool reap_orphans(int fd) {
+void await_orphans(stream& watch, ready_handler handler) {
+    watch.async_wait(stream::wait_read, std::move(handler));
+}
+
+bool reap_orphans(stream& watch) {
     // One pending signal stands for any number of ends; the scan below finds them.
     signalfd_siginfo pending[8];
-    while (read(fd, pending, sizeof pending) > 0) {
+    while (read(watch.native_handle(), pending, sizeof pending) > 0) {
     }
     std::lock_guard<std::mutex> lock(supervised_guard);
     for (;;) {

@@ -1,8 +1,6 @@
 // The end of a child: its exit, the restart rule, and leaving the daemon.
 #include "process/process.hpp"
 
-#include <boost/asio/post.hpp>
-
 #include "daemon/daemon.hpp"
 
 namespace torvad {
@@ -23,16 +21,15 @@ std::uint32_t exit_code_of(const platform::exit_status& exit, bool forced) {
 }
 
 void process::on_exit(const boost::system::error_code& error) {
-    // Only a closing handle ends the wait with an error, and then the object
-    // may be gone: touch nothing.
+    // Only a closing handle ends the wait with an error: finish has run.
     if (error)
         return;
-    platform::exit_status exit = platform::reap_child(exit_watch.native_handle());
+    platform::exit_status exit = platform::exit_status_of(exit_watch);
     if (!exit.ended) {
         // Readiness is a hint: the loop can hand the stale readiness of a
         // descriptor closed in this turn to one opened after it. Only a reaped
         // status is the end of a child.
-        watch_exit();
+        wait_for_exit();
         return;
     }
     if (exit.error) {
@@ -41,9 +38,18 @@ void process::on_exit(const boost::system::error_code& error) {
     }
     std::uint32_t code = exit_code_of(exit, forced);
     // All the child wrote is in its pipes now. What a descendant still holds
-    // open is not waited for: take what is there and close.
-    drain_output();
-    finish(code, packet_closed);
+    // open is not waited for: take what is there and close. A read on its
+    // way holds bytes from before the rest, so its landing comes first.
+    ending = true;
+    ended_status = code;
+    finish_after_output();
+}
+
+void process::finish_after_output() {
+    if (!ending || !drain_output())
+        return;
+    ending = false;
+    finish(ended_status, packet_closed);
 }
 
 void process::close_pipes() {
@@ -80,11 +86,8 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     // successor's opened: a peer that sent two requests in one write sees
     // their ends in the order it asked, and may use the id again at once.
     report_end();
-    // Completions that were already queued when the pipes closed still run and
-    // may hold a plain pointer to us; this handler, queued behind them, keeps
-    // the object alive until they have.
+    // Leaving the set may drop the last reference but ours.
     auto self = shared_from_this();
-    boost::asio::post(*owner, [self] {});
     owner->remove(self);
 }
 
@@ -92,7 +95,7 @@ void process::restart() {
     owner->log_info("starting '%s' again.", name.c_str());
     // The successor is in children before we leave, so the run never looks
     // empty across a restart.
-    create(owner, command, user, working_directory, {parent, channel}, persistent, stdio_mode)
+    create(owner, {command, user, working_directory, persistent, stdio_mode}, {parent, channel})
         ->start();
 }
 
@@ -103,7 +106,7 @@ void process::terminate() {
     }
     if (exit_watch.is_open()) {
         forced = true;
-        platform::kill_child(exit_watch.native_handle());
+        platform::end_by_force(exit_watch);
     }
 }
 
