@@ -9,7 +9,6 @@
 #include <unordered_set>
 
 #include <boost/asio/io_context.hpp>
-#include <boost/asio/posix/stream_descriptor.hpp>
 #include <boost/asio/signal_set.hpp>
 
 #include "ipc/patterns.hpp"
@@ -87,6 +86,7 @@ class daemon : public boost::asio::io_context {
     void log_line(event_type type, int colour_number, const char* format, va_list args);
     void load_patterns(const char* path);
     void terminate_children();
+    void name_awaited_children();
     void arm_signal_wait();
     void on_signal(const boost::system::error_code& error, int signal_number);
     void persistent_children_changed();
@@ -101,9 +101,10 @@ class daemon : public boost::asio::io_context {
     std::unordered_set<std::shared_ptr<process>> children_;
     std::size_t persistent_children_ = 0; // kept with children_, so never counted
     boost::asio::signal_set signals_;
-    boost::asio::posix::stream_descriptor orphan_watch_;
+    platform::stream orphan_watch_;
     pattern_lists patterns_;
     bool children_report_posted_ = false;
+    bool stop_requested_ = false;
 };
 
 // The supervisor of this program, built before main and gone after it.

@@ -8,41 +8,32 @@
 namespace torvad {
 
 void daemon::take_orphans() {
-    int fd = -1;
-    platform::os_error error = platform::watch_orphans(fd);
-    if (error) {
+    platform::os_error error = platform::watch_orphans(orphan_watch_);
+    if (error)
         log_verbose("%s", platform::describe(error).c_str());
-        return;
-    }
-    boost::system::error_code failure;
-    orphan_watch_.assign(fd, failure);
-    if (failure) {
-        platform::close_descriptor(fd);
-        return;
-    }
-    wait_for_orphans();
+    // Where nothing is ever handed over, nothing is watched.
+    if (orphan_watch_.is_open())
+        wait_for_orphans();
 }
 
 void daemon::wait_for_orphans() {
     // The daemon outlives the loop's handlers; a closed watch ends the wait.
-    orphan_watch_.async_wait(boost::asio::posix::stream_descriptor::wait_read,
-                             [this](const boost::system::error_code& error) {
-                                 if (error)
-                                     return;
-                                 // Behind what is ready already: a supervised
-                                 // child's end, and its restart, need not
-                                 // wait for a scan of the others.
-                                 boost::asio::post(*this, [this] {
-                                     reap_orphans();
-                                     wait_for_orphans();
-                                 });
-                             });
+    platform::await_orphans(orphan_watch_, [this](const boost::system::error_code& error) {
+        if (error)
+            return;
+        // Behind what is ready already: a supervised child's end, and its
+        // restart, need not wait for a scan of the others.
+        boost::asio::post(*this, [this] {
+            reap_orphans();
+            wait_for_orphans();
+        });
+    });
 }
 
 void daemon::reap_orphans() {
     // A supervised child's end stands in front of the others; its exit wait,
     // queued already, takes its status, and this comes again behind it.
-    if (!platform::reap_orphans(orphan_watch_.native_handle()))
+    if (!platform::reap_orphans(orphan_watch_))
         boost::asio::post(*this, [this] { reap_orphans(); });
 }
 

@@ -37,18 +37,12 @@ bool schedule_with_task_scheduler(const std::string& tool, const std::string& se
            platform::run_program(tool, {"/run", "/tn", task_name}, none, {}).error == 0;
 }
 
-bool schedule_with_systemd(const std::string& tool, const std::string& service_name,
-                           const std::string& core_path) {
-    auto arguments = systemd_run_arguments(service_name, core_path);
-    return platform::run_program(tool, arguments, platform::returned_stream::none, {}).error == 0;
-}
-
+// Where no task scheduler is found the system schedules the same job its own way.
 bool hand_over(const std::string& service_name, const std::string& core_path) {
     std::string tool = platform::search_path("schtasks");
     if (!tool.empty())
         return schedule_with_task_scheduler(tool, service_name, core_path);
-    tool = platform::search_path("systemd-run");
-    return !tool.empty() && schedule_with_systemd(tool, service_name, core_path);
+    return platform::schedule_handover_job(service_name, core_path);
 }
 
 } // namespace

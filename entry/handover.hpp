@@ -3,7 +3,6 @@
 #pragma once
 
 #include <string>
-#include <vector>
 
 namespace torvad {
 
@@ -15,10 +14,5 @@ void check_service_program(const std::string& service_name);
 
 // The action of the scheduled task, one string as the scheduler takes it.
 std::string task_action(const std::string& service_name, const std::string& core_path);
-
-// The arguments of systemd-run that schedule the same job where the task
-// scheduler is missing.
-std::vector<std::string> systemd_run_arguments(const std::string& service_name,
-                                               const std::string& core_path);
 
 } // namespace torvad

@@ -37,8 +37,11 @@ void choose_what_to_supervise(command_line& options) {
             start_web_service();
         return;
     }
-    auto top = process::create(&the_daemon, std::move(options.command), std::move(options.user),
-                               ".", {}, true, stdio_inherit);
+    auto top = process::create(&the_daemon, {.command = std::move(options.command),
+                                             .user = std::move(options.user),
+                                             .working_directory = ".",
+                                             .persistent = true,
+                                             .stdio_mode = stdio_inherit});
     // Attached before the program's name is known, so its version packet
     // names no program: peers that attach have always seen it so.
     if (options.attach_pid != 0)
@@ -66,8 +69,7 @@ void run_at_console() {
 int main(int argc, char** argv) {
     // The start state (standard fds, signal dispositions) was made before the
     // daemon was built; see daemon.cpp.
-    // A line is worth seeing at once, also when stdout is a pipe or a journal.
-    std::setvbuf(stdout, nullptr, _IOLBF, 0);
+    platform::unbuffer_output();
     background = !platform::stdout_is_terminal();
 
     command_line options = scan_command_line(argc, argv);
@@ -100,7 +102,8 @@ int main(int argc, char** argv) {
     else
         // Outside a service manager this fails at once and nothing was
         // started: the run simply ends, so its result changes nothing here.
-        (void)platform::run_service_dispatcher(run_service, service_control_stop);
+        (void)platform::run_service_dispatcher(the_daemon.service_name(), run_service,
+                                               service_control_stop);
 
     if (!pid_file.empty())
         platform::remove_file(pid_file);

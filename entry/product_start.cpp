@@ -67,13 +67,20 @@ void start_server_family(const std::string& family) {
     bool patterns_present = platform::path_exists(patterns_name);
     check_service_program(service_name);
     std::string user = core_account();
-    process::create(&the_daemon, {"./core"}, std::move(user), ".", {}, true, stdio_inherit);
+    process::create(&the_daemon, {.command = {"./core"},
+                                  .user = std::move(user),
+                                  .working_directory = ".",
+                                  .persistent = true,
+                                  .stdio_mode = stdio_inherit});
     the_daemon.configure(service_name, patterns_present ? patterns_name : nullptr);
 }
 
 void start_web_service() {
-    process::create(&the_daemon, {"./wfe"}, "NT Authority\\LocalService", ".", {}, true,
-                    stdio_inherit);
+    process::create(&the_daemon, {.command = {"./wfe"},
+                                  .user = "NT Authority\\LocalService",
+                                  .working_directory = ".",
+                                  .persistent = true,
+                                  .stdio_mode = stdio_inherit});
     the_daemon.configure("WebService", nullptr);
 }
 

@@ -1,9 +1,9 @@
 // The operating system seam: every system call the supervisor makes goes
 // through one of these free functions, named for what it does. The build picks
-// the implementation (platform/posix_*.cpp on Linux); nothing here owns state
-// beyond the descriptors it hands back, which the caller then owns, the pids
-// of the children it launched until their status is taken, and what it last
-// told the service manager.
+// the implementation (platform/posix_*.cpp on Linux, win32_*.cpp on Windows;
+// files.cpp on both); nothing here owns state beyond the handles it hands
+// back, which the caller then owns, what it keeps to tell its own children
+// from orphans, and what it last told the service manager.
 #pragma once
 
 #include <cstddef>
@@ -13,13 +13,18 @@
 #include <string>
 #include <vector>
 
+#include <boost/system/error_code.hpp>
+
+#include "platform/handles.hpp"
+
 namespace torvad::platform {
 
-// The executable suffix of this system: empty here, ".exe" on Windows.
+// The executable suffix of this system: empty on Linux, ".exe" on Windows.
 extern const char* const exe_suffix;
 
-// A failed system call: its errno and its name, for a log line that says
-// which call failed and why. code 0 is success.
+// A failed system call: the system's error code (errno, or GetLastError) and
+// the call's name, for a log line that says which call failed and why. code 0
+// is success.
 struct os_error {
     int code = 0;
     const char* call = "";
@@ -30,25 +35,33 @@ std::string describe(const os_error& error);
 
 // --- the supervisor's own process ---------------------------------------------
 
-// Makes the start state whatever the parent left: fds 0, 1, 2 open (on
-// /dev/null where closed, before anything else takes those numbers), default
-// SIGCHLD so that exits can be waited for, SIGPIPE ignored so that a peer
-// closing its end is a write error, and no signal blocked.
+// Makes the start state whatever the parent left: standard streams open,
+// exits of children observable, a peer closing its end only a write error,
+// and no signal blocked.
 void prepare_own_process();
+// Each log line reaches stdout as it is written, with its line feed as it is.
+void unbuffer_output();
 int current_process_id();
 bool stdout_is_terminal();
+// Whether the console takes the escape sequences of colour, switching them on
+// where the console must be asked.
+bool console_takes_colour();
 bool change_directory(const std::string& path);
 std::tm local_time_now();
 // Writes the file "<pid>\n"; false when it can't be created.
 bool write_pid_file(const std::string& path, int pid);
 void remove_file(const std::string& path);
 // The absolute, normal form of path against the current directory; an error
-// when that directory can't be had (it may have been deleted).
+// when path is relative and that directory can't be had (it may have been
+// deleted).
 std::string absolute_path(const std::string& path, os_error& error);
-// The path of an executable found on PATH, or empty.
+// The path of an executable found on PATH (with the extensions of PATHEXT on
+// Windows), or empty.
 std::string search_path(const std::string& name);
 // The whole content of a file.
 os_error read_file(const std::string& path, std::string& content);
+// True when something of any type stands at path (a directory counts too).
+bool path_exists(const std::string& path);
 
 // Runs work on a thread with a stack of stack_bytes and waits for it; what
 // work throws is thrown here. False when no such thread could be had.
@@ -60,88 +73,96 @@ enum class event_type : std::uint16_t { error = 1, warning = 2, information = 4 
 // One record; the log is opened on the first record only.
 void write_event_record(event_type type, const char* text);
 
-// --- descriptors ----------------------------------------------------------------
+// --- pipes ----------------------------------------------------------------------
 
-void close_descriptor(int fd);
-// A connected pair of stream sockets, both close-on-exec.
-os_error make_ipc_pair(int& ours, int& theirs);
-// A pipe, both ends close-on-exec.
-os_error make_pipe(int& read_end, int& write_end);
-// True when fd names an open descriptor.
-bool descriptor_is_open(int fd);
+// The duplex pipe of a persistent child: ours bound to the loop, theirs to be
+// inherited by the child, whose last argument names it.
+os_error make_ipc_pipe(stream& ours, owned_handle& theirs);
+// A relayed standard stream: for stdin (stream 0) the child reads theirs and
+// we write ours; for stdout and stderr (1, 2) the other way round.
+os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs);
+// Binds a pipe that another program made and gave us by its handle value.
+os_error attach_pipe(stream& ours, std::int64_t value);
 
-// --- accounts and launching -----------------------------------------------------
+// Relayed output, read as it comes. await_output completes when bytes can be
+// taken without waiting (on Windows: when one read has landed in buffer);
+// take_output then gives one read's worth at a time, would_block when there
+// is nothing more now, and another error when the stream has ended.
+using ready_handler = std::function<void(const boost::system::error_code&)>;
+void await_output(stream& pipe, output_buffer& buffer, ready_handler handler);
+boost::system::error_code take_output(stream& pipe, output_buffer& buffer, const char*& data,
+                                      std::size_t& size);
+// True while a read armed by await_output may still land bytes: what is in the
+// pipe behind them can't be taken before it has. Ends such a read early.
+bool output_in_flight(const output_buffer& buffer);
+void cut_output_short(stream& pipe);
 
-// An account resolved before the launch, so the child only makes system calls.
-struct account {
-    bool change = false; // false: run as ourselves
-    unsigned uid = 0;
-    unsigned gid = 0;
-    std::vector<unsigned> groups;
-};
+// --- launching and ending children ---------------------------------------------
 
-// Resolves "domain\name" (empty domain or "." is this machine). Returns 0, or
-// the errno-like reason the logon is refused.
-int resolve_account(const std::string& user, account& out);
-
-enum class stdio_source { inherit, descriptors, null_device };
+enum class stdio_source { inherit, handles, none };
 
 struct launch_request {
     std::string executable;        // absolute path
     std::vector<std::string> argv; // argv[0] included
+    std::string command_line;      // argv quoted and joined, as Windows takes it
     std::string working_directory; // empty: ours
+    std::string user;              // "domain\name" to run as; empty: our own account
     stdio_source stdio = stdio_source::inherit;
-    int stdio_fds[3] = {-1, -1, -1}; // with stdio_source::descriptors
-    int ipc_fd = -1;                 // the child has it at child_ipc_fd(ipc_fd)
-    bool own_process_group = false;  // keeps a terminal's signals from the child
-    account user;
+    native_handle stdio_handles[3] = {no_handle, no_handle,
+                                      no_handle}; // with stdio_source::handles
+    native_handle ipc = no_handle;                // inherited; the child is told handle_value(ipc)
+    bool own_process_group = false;               // keeps a terminal's signals from the child
 };
 
-// Where a launch failed: switching to the account, or making the child.
+// Where a launch failed: the logon to the account, or making the child.
 enum class launch_step { none, logon, create };
 
 struct launch_result {
     int pid = 0;
-    int pidfd = -1; // owned by the caller on success
+    owned_handle process; // what watch_exit binds: a pidfd, or the process handle
     launch_step failed_step = launch_step::none;
     os_error error;
 };
 
-// The number a launched child knows its end of the ipc pair by, for its last
-// argument: here always the first after its standard streams.
-int child_ipc_fd(int ipc_fd);
-
-// Launches the child. It keeps exactly fds 0, 1, 2 and ipc_fd, starts with
-// default signal dispositions, an empty mask and the environment without the
-// service manager's socket, and any failure before exec is known (step, call
-// and errno) when this returns.
+// Launches the child. On Linux it keeps exactly fds 0, 1, 2 and the ipc end,
+// starts with default signal dispositions, an empty mask and the environment
+// without the service manager's socket; on Windows it inherits what handle
+// inheritance gives it. Any failure before the child runs is known (step, call
+// and code) when this returns.
 launch_result launch_child(const launch_request& request);
 
+// Binds the process handle of a launch to watch; on failure it stays in process.
+os_error watch_exit(exit_watch& watch, owned_handle& process);
+// Completes once the child may have ended (on Linux a hint: see exit_status).
+void await_exit(exit_watch& watch, ready_handler handler);
+
 struct exit_status {
-    bool ended = false;  // false: still running, the readiness was spurious
+    bool ended = false;  // false: still running, the wait's completion was stale
     bool exited = false; // false: killed by a signal
     int code = 0;        // exit status, or the signal number
-    os_error error;      // the wait itself failed: the status is unknown
+    os_error error;      // the status could not be read
 };
 
-// Reaps the child behind pidfd without blocking, if it has ended.
-exit_status reap_child(int pidfd);
-// Ends the child by force.
-void kill_child(int pidfd);
-// Ends the child by force, reaps it and closes its pidfd, all before returning.
-void end_child_now(int pidfd);
+// The end of the child behind watch, if it has ended; it is reaped then.
+exit_status exit_status_of(exit_watch& watch);
+// Ends the child by force (TerminateProcess with 0 on Windows).
+void end_by_force(exit_watch& watch);
+// Ends the child by force and releases it, all before returning: for a child
+// whose exit can't be watched.
+void end_now(owned_handle& process);
 
 // --- orphans ----------------------------------------------------------------------
 
 // Makes us the reaper of our descendants whose parent has gone (the first
-// process of a PID namespace is that already) and gives a descriptor that is
-// readable when a child may have ended; -1 where no orphan is ever handed over.
-// Called before any thread is started.
-os_error watch_orphans(int& fd);
+// process of a PID namespace is that already) and binds watch to what tells
+// that one may have ended. watch stays closed where no orphan is ever handed
+// over (Windows). Called before any thread is started.
+os_error watch_orphans(stream& watch);
+void await_orphans(stream& watch, ready_handler handler);
 // Reaps every ended child that is not one launched above, whose status stays
-// for reap_child. False when such a child's end hides others: call again once
-// its status has been taken.
-bool reap_orphans(int fd);
+// for exit_status_of. False when such a child's end hides others: call again
+// once its status has been taken.
+bool reap_orphans(stream& watch);
 
 // --- the service manager --------------------------------------------------------
 
@@ -150,8 +171,9 @@ bool reap_orphans(int fd);
 void hold_stop_requests();
 // Runs service_main on a thread of its own when the service manager started us
 // (or a container runtime, which stands for it), delivering stop requests to
-// on_stop from this thread; false at once otherwise.
-bool run_service_dispatcher(const std::function<void()>& service_main,
+// on_stop from this thread; false at once otherwise. service_main runs only
+// once the service could be registered under name.
+bool run_service_dispatcher(const std::string& name, const std::function<void()>& service_main,
                             const std::function<void()>& on_stop);
 
 enum class service_state { start_pending, running, stop_pending, stopped };
@@ -167,24 +189,26 @@ void report_service_children(std::size_t count);
 // (the product's start: the service program check, the init script, the hand-over)
 namespace torvad::platform {
 
-// True when something of any type stands at path (a directory counts too).
-bool path_exists(const std::string& path);
-
 // Which of the program's standard streams comes back to the caller.
 enum class returned_stream { none = 0, output = 1, error = 2 };
 
 struct program_end {
-    int error = 0;      // errno when the program could not be started at all
+    int error = 0;      // the system's code when the program could not be started at all
     int exit_code = -1; // its exit status, or 128 + the signal that ended it
 };
 
 // Runs the program at path (relative: to the working directory, never searched
 // for) with args behind argv[0] = path, and waits for its end without a time
 // limit. The returned stream is handed to on_output as it arrives, so the
-// program never blocks on a full pipe; its other streams are ours. It gets
-// our environment less NOTIFY_SOCKET, and no descriptor beyond 0, 1 and 2.
+// program never blocks on a full pipe; its other streams are ours. On Linux it
+// gets our environment less NOTIFY_SOCKET, and no descriptor beyond 0, 1 and 2.
 program_end run_program(const std::string& path, const std::vector<std::string>& args,
                         returned_stream returned,
                         const std::function<void(const char*, std::size_t)>& on_output);
+
+// The hand-over's job where no task scheduler ("schtasks") is on PATH: one that
+// runs once as the system account after our end, points service_name at
+// core_path and starts the service. False when it could not be scheduled.
+bool schedule_handover_job(const std::string& service_name, const std::string& core_path);
 
 } // namespace torvad::platform

@@ -1,10 +1,13 @@
 // What the Linux side of the seam keeps about the children it launches: their
 // pids until their status is taken, which is how an orphan that the kernel
-// hands us is told from a child we supervise.
+// hands us is told from a child we supervise; and the account a launch
+// switches to, resolved before the child is made.
 #pragma once
 
 #include <mutex>
+#include <string>
 #include <sys/wait.h>
+#include <vector>
 
 namespace torvad::platform {
 
@@ -17,5 +20,17 @@ void note_supervised(int pid);
 // waitid on the child behind pidfd, retried on EINTR; once its status is
 // taken its pid is forgotten. The result and errno are waitid's.
 int wait_supervised(int pidfd, siginfo_t& info, int options);
+
+// An account resolved before the launch, so the child only makes system calls.
+struct account {
+    bool change = false; // false: run as ourselves
+    unsigned uid = 0;
+    unsigned gid = 0;
+    std::vector<unsigned> groups;
+};
+
+// Resolves "domain\name" (empty domain or "." is this machine). Returns 0, or
+// the errno-like reason the logon is refused.
+int resolve_account(const std::string& user, account& out);
 
 } // namespace torvad::platform

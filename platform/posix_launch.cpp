@@ -26,13 +26,11 @@ namespace torvad::platform {
 
 namespace {
 
-// A child's ipc end, the first number after its standard streams.
-constexpr int child_ipc_number = 3;
-
 // Everything the child needs, made before the clone, and the one place the
 // child writes back: its memory is ours until it calls exec.
 struct child_plan {
     const launch_request* request;
+    const account* user;
     char* const* argv;
     char* const* envp;
     int stdio_sources[3]; // what becomes the child's 0, 1 and 2
@@ -63,7 +61,7 @@ void reset_signals() {
 // The raw system calls: glibc's wrappers of these would signal every thread
 // of the process whose memory we share.
 void switch_account(child_plan& plan) {
-    const account& user = plan.request->user;
+    const account& user = *plan.user;
     if (syscall(SYS_setgroups, user.groups.size(), user.groups.data()) == -1)
         give_up(plan, launch_step::logon, "setgroups");
     if (syscall(SYS_setgid, user.gid) == -1)
@@ -75,7 +73,7 @@ void switch_account(child_plan& plan) {
 // Until the first call here our descriptor table is the child's too, and
 // nothing in it may change. The unsharing close copies only what lies below
 // the range it closes: the low numbers, where launch_child put what the child
-// keeps. Leaves open exactly 0, 1, 2 and the ipc end, at child_ipc_fd.
+// keeps. Leaves open exactly 0, 1, 2 and the ipc end, at child_ipc_handle.
 void keep_own_descriptors(child_plan& plan) {
     if (close_range(plan.last_kept + 1, ~0U, CLOSE_RANGE_UNSHARE) == -1)
         give_up(plan, launch_step::create, "close_range");
@@ -84,14 +82,14 @@ void keep_own_descriptors(child_plan& plan) {
         if (source != target && dup2(source, target) == -1)
             give_up(plan, launch_step::create, "dup2");
     }
-    if (plan.ipc_source == child_ipc_number) {
+    if (plan.ipc_source == child_ipc_handle) {
         // dup2 onto itself would leave close-on-exec set.
-        if (fcntl(child_ipc_number, F_SETFD, 0) == -1)
+        if (fcntl(child_ipc_handle, F_SETFD, 0) == -1)
             give_up(plan, launch_step::create, "fcntl");
-    } else if (plan.ipc_source != -1 && dup2(plan.ipc_source, child_ipc_number) == -1) {
+    } else if (plan.ipc_source != -1 && dup2(plan.ipc_source, child_ipc_handle) == -1) {
         give_up(plan, launch_step::create, "dup2");
     }
-    int first_closed = plan.ipc_source == -1 ? 3 : child_ipc_number + 1;
+    int first_closed = plan.ipc_source == -1 ? 3 : child_ipc_handle + 1;
     if (first_closed <= plan.last_kept && close_range(first_closed, plan.last_kept, 0) == -1)
         give_up(plan, launch_step::create, "close_range");
 }
@@ -103,7 +101,7 @@ int become_child(void* argument) {
     reset_signals();
     if (request.own_process_group && setpgid(0, 0) == -1)
         give_up(plan, launch_step::create, "setpgid");
-    if (request.user.change)
+    if (plan.user->change)
         switch_account(plan);
     if (!request.working_directory.empty() && chdir(request.working_directory.c_str()) == -1)
         give_up(plan, launch_step::create, "chdir");
@@ -136,10 +134,17 @@ std::vector<char*> child_environment() {
 
 // Clones with every signal blocked, so that no handler of ours runs in the
 // child before it has reset them; our own mask comes back after.
+launch_result failed_launch(launch_step step, os_error error) {
+    launch_result result;
+    result.failed_step = step;
+    result.error = error;
+    return result;
+}
+
 launch_result clone_child(child_plan& plan) {
     char* stack = child_stack_top();
     if (stack == nullptr)
-        return {0, -1, launch_step::create, {ENOMEM, "mmap"}};
+        return failed_launch(launch_step::create, {ENOMEM, "mmap"});
     sigset_t all, saved;
     sigfillset(&all);
     pthread_sigmask(SIG_SETMASK, &all, &saved);
@@ -151,17 +156,20 @@ launch_result clone_child(child_plan& plan) {
     int clone_error = errno;
     pthread_sigmask(SIG_SETMASK, &saved, nullptr);
     if (pid == -1)
-        return {0, -1, launch_step::create, {clone_error, "clone"}};
+        return failed_launch(launch_step::create, {clone_error, "clone"});
     if (plan.failed_step == launch_step::none) {
         note_supervised(static_cast<int>(pid));
-        return {static_cast<int>(pid), pidfd, launch_step::none, {}};
+        launch_result result;
+        result.pid = static_cast<int>(pid);
+        result.process.reset(pidfd);
+        return result;
     }
     // It has called _exit already; reap it so that no zombie stays behind.
     // Its pid was never noted, and the guard we hold keeps it from the orphans.
     siginfo_t info{};
     waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED);
     close(pidfd);
-    return {0, -1, plan.failed_step, plan.error};
+    return failed_launch(plan.failed_step, plan.error);
 }
 
 // The low numbers where a launch puts what its child keeps, so that the child
@@ -188,7 +196,8 @@ os_error reserve(low_slots& slots) {
         if (*slot == -1) {
             os_error error{errno, "fcntl"};
             for (int fd : {made.null_fd, made.stdio[0], made.stdio[1], made.stdio[2]})
-                close_descriptor(fd);
+                if (fd != -1)
+                    close(fd);
             return error;
         }
         made.last = std::max(made.last, *slot);
@@ -227,18 +236,18 @@ low_slots slots;
 os_error place_descriptors(const launch_request& request, slot_filling& filling, child_plan& plan) {
     for (int target = 0; target < 3; ++target) {
         int& source = plan.stdio_sources[target];
-        source = request.stdio == stdio_source::descriptors   ? request.stdio_fds[target]
-                 : request.stdio == stdio_source::null_device ? slots.null_fd
-                                                              : target;
+        source = request.stdio == stdio_source::handles ? request.stdio_handles[target]
+                 : request.stdio == stdio_source::none  ? slots.null_fd
+                                                        : target;
         // Our own standard streams are low already.
-        if (request.stdio == stdio_source::descriptors && source > 2) {
+        if (request.stdio == stdio_source::handles && source > 2) {
             if (os_error error = filling.fill(source, slots.stdio[target]))
                 return error;
             source = slots.stdio[target];
         }
     }
-    if (request.ipc_fd != -1) {
-        if (os_error error = filling.fill(request.ipc_fd, slots.ipc))
+    if (request.ipc != no_handle) {
+        if (os_error error = filling.fill(request.ipc, slots.ipc))
             return error;
         plan.ipc_source = slots.ipc;
     }
@@ -247,45 +256,64 @@ os_error place_descriptors(const launch_request& request, slot_filling& filling,
 
 } // namespace
 
-int child_ipc_fd(int /*ipc_fd*/) {
-    return child_ipc_number;
-}
-
 launch_result launch_child(const launch_request& request) {
     static_assert(sizeof(unsigned) == sizeof(gid_t));
+    account user;
+    if (!request.user.empty())
+        if (int refused = resolve_account(request.user, user))
+            return failed_launch(launch_step::logon, {refused, "resolve account"});
     std::vector<char*> argv;
     for (const auto& argument : request.argv)
         argv.push_back(const_cast<char*>(argument.c_str()));
     argv.push_back(nullptr);
     std::vector<char*> envp = child_environment();
     if (os_error error = reserve(slots))
-        return {0, -1, launch_step::create, error};
-    child_plan plan{&request, argv.data(), envp.data(),       {0, 1, 2},
-                    -1,       slots.last,  launch_step::none, {}};
+        return failed_launch(launch_step::create, error);
+    child_plan plan{&request, &user,      argv.data(),       envp.data(), {0, 1, 2},
+                    -1,       slots.last, launch_step::none, {}};
     slot_filling filling(slots);
     if (os_error error = place_descriptors(request, filling, plan))
-        return {0, -1, launch_step::create, error};
+        return failed_launch(launch_step::create, error);
     return clone_child(plan);
 }
 
-exit_status reap_child(int pidfd) {
+os_error watch_exit(exit_watch& watch, owned_handle& process) {
+    boost::system::error_code failure;
+    watch.assign(process.get(), failure);
+    if (failure)
+        return {failure.value(), "assign"};
+    process.release();
+    return {};
+}
+
+void await_exit(exit_watch& watch, ready_handler handler) {
+    watch.async_wait(exit_watch::wait_read, std::move(handler));
+}
+
+exit_status exit_status_of(exit_watch& watch) {
     siginfo_t info{};
-    if (wait_supervised(pidfd, info, WEXITED | WNOHANG) == -1)
+    if (wait_supervised(watch.native_handle(), info, WEXITED | WNOHANG) == -1)
         return {true, false, 0, {errno, "waitid"}};
     if (info.si_pid == 0)
         return {};
     return {true, info.si_code == CLD_EXITED, info.si_status, {}};
 }
 
+namespace {
 void kill_child(int pidfd) {
     syscall(SYS_pidfd_send_signal, pidfd, SIGKILL, nullptr, 0);
 }
+} // namespace
 
-void end_child_now(int pidfd) {
-    kill_child(pidfd);
+void end_by_force(exit_watch& watch) {
+    kill_child(watch.native_handle());
+}
+
+void end_now(owned_handle& process) {
+    kill_child(process.get());
     siginfo_t info{};
-    wait_supervised(pidfd, info, WEXITED);
-    close(pidfd);
+    wait_supervised(process.get(), info, WEXITED);
+    process.reset();
 }
 
 } // namespace torvad::platform

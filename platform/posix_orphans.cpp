@@ -82,8 +82,7 @@ int wait_supervised(int pidfd, siginfo_t& info, int options) {
     return waited;
 }
 
-os_error watch_orphans(int& fd) {
-    fd = -1;
+os_error watch_orphans(stream& watch) {
     // The first process of a PID namespace is the reaper there already.
     if (getpid() != 1 && prctl(PR_SET_CHILD_SUBREAPER, 1) == -1)
         return {errno, "prctl"};
@@ -94,17 +93,26 @@ os_error watch_orphans(int& fd) {
     // descriptor and interrupts no call. Children start with an empty mask.
     if (int error = pthread_sigmask(SIG_BLOCK, &child_ended, nullptr))
         return {error, "pthread_sigmask"};
-    fd = signalfd(-1, &child_ended, SFD_NONBLOCK | SFD_CLOEXEC);
-    if (fd == -1)
+    owned_handle fd(signalfd(-1, &child_ended, SFD_NONBLOCK | SFD_CLOEXEC));
+    if (!fd.valid())
         return {errno, "signalfd"};
+    boost::system::error_code failure;
+    watch.assign(fd.get(), failure);
+    if (failure)
+        return {failure.value(), "assign"};
+    fd.release();
     watching = true;
     return {};
 }
 
-bool reap_orphans(int fd) {
+void await_orphans(stream& watch, ready_handler handler) {
+    watch.async_wait(stream::wait_read, std::move(handler));
+}
+
+bool reap_orphans(stream& watch) {
     std::lock_guard<std::mutex> lock(supervised_guard);
     // One pending signal stands for any number of ends; the scan below finds them.
-    if (!scan_due(fd))
+    if (!scan_due(watch.native_handle()))
         return true;
     for (;;) {
         // A peek leaves the child as it is; only an orphan is then reaped.

@@ -12,15 +12,7 @@
 
 #include "platform/posix_children.hpp"
 
-#include <boost/filesystem/operations.hpp>
-
 namespace torvad::platform {
-
-bool path_exists(const std::string& path) {
-    boost::system::error_code error;
-    auto type = boost::filesystem::status(path, error).type();
-    return type != boost::filesystem::status_error && type != boost::filesystem::file_not_found;
-}
 
 namespace {
 
@@ -76,24 +68,25 @@ program_end run_program(const std::string& path, const std::vector<std::string>&
     request.executable = path;
     request.argv.push_back(path);
     request.argv.insert(request.argv.end(), args.begin(), args.end());
-    int read_end = -1, write_end = -1;
+    owned_handle source, sink;
     if (returned != returned_stream::none) {
-        if (os_error error = make_pipe(read_end, write_end))
-            return {error.code};
-        request.stdio = stdio_source::descriptors;
+        int ends[2];
+        if (pipe2(ends, O_CLOEXEC) == -1)
+            return {errno};
+        source.reset(ends[0]);
+        sink.reset(ends[1]);
+        request.stdio = stdio_source::handles;
         for (int fd = 0; fd < 3; ++fd)
-            request.stdio_fds[fd] = fd == static_cast<int>(returned) ? write_end : fd;
+            request.stdio_handles[fd] = fd == static_cast<int>(returned) ? sink.get() : fd;
     }
     launch_result launched = launch_child(request);
-    close_descriptor(write_end);
-    if (launched.failed_step == launch_step::none && read_end >= 0)
-        relay_until_end(read_end, launched.pidfd, on_output);
-    close_descriptor(read_end);
+    // Only the program holds the writing end now, so its end is our end of file.
+    sink.reset();
     if (launched.failed_step != launch_step::none)
         return {launched.error.code};
-    program_end end{0, wait_for_exit_code(launched.pidfd)};
-    close_descriptor(launched.pidfd);
-    return end;
+    if (source.valid())
+        relay_until_end(source.get(), launched.process.get(), on_output);
+    return {0, wait_for_exit_code(launched.process.get())};
 }
 
 } // namespace torvad::platform

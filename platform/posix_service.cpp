@@ -31,7 +31,8 @@ void hold_stop_requests() {
     pthread_sigmask(SIG_BLOCK, &stop, nullptr);
 }
 
-bool run_service_dispatcher(const std::function<void()>& service_main,
+// The manager knows us by the unit, not by a name we give.
+bool run_service_dispatcher(const std::string& /*name*/, const std::function<void()>& service_main,
                             const std::function<void()>& on_stop) {
     if (std::getenv("NOTIFY_SOCKET") == nullptr && getpid() != 1)
         return false;

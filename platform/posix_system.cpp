@@ -1,4 +1,4 @@
-// The supervisor's own process, files, descriptors and the event log on Linux.
+// The supervisor's own process, its files and the event log on Linux.
 #include "platform/platform.hpp"
 
 #include <cerrno>
@@ -6,12 +6,8 @@
 #include <cstdio>
 #include <cstring>
 #include <fcntl.h>
-#include <sys/socket.h>
 #include <syslog.h>
 #include <unistd.h>
-
-#include <boost/filesystem/operations.hpp>
-#include <boost/process/search_path.hpp>
 
 namespace torvad::platform {
 
@@ -43,8 +39,18 @@ int current_process_id() {
     return static_cast<int>(getpid());
 }
 
+void unbuffer_output() {
+    // A line is worth seeing at once, also when stdout is a pipe or a journal.
+    std::setvbuf(stdout, nullptr, _IOLBF, 0);
+}
+
 bool stdout_is_terminal() {
     return isatty(STDOUT_FILENO) == 1;
+}
+
+// A terminal takes them; nothing needs to be switched on.
+bool console_takes_colour() {
+    return stdout_is_terminal();
 }
 
 bool change_directory(const std::string& path) {
@@ -56,36 +62,6 @@ std::tm local_time_now() {
     std::tm local{};
     localtime_r(&now, &local);
     return local;
-}
-
-bool write_pid_file(const std::string& path, int pid) {
-    std::FILE* file = std::fopen(path.c_str(), "w");
-    if (file == nullptr)
-        return false;
-    std::fprintf(file, "%d\n", pid);
-    return std::fclose(file) == 0;
-}
-
-void remove_file(const std::string& path) {
-    std::remove(path.c_str());
-}
-
-std::string absolute_path(const std::string& path, os_error& error) {
-    boost::filesystem::path given(path);
-    // Only a relative path needs the current directory, a system call.
-    if (given.is_absolute())
-        return given.lexically_normal().string();
-    boost::system::error_code failure;
-    auto directory = boost::filesystem::current_path(failure);
-    if (failure) {
-        error = {failure.value(), "getcwd"};
-        return path;
-    }
-    return boost::filesystem::absolute(path, directory).lexically_normal().string();
-}
-
-std::string search_path(const std::string& name) {
-    return boost::process::search_path(name).string();
 }
 
 os_error read_file(const std::string& path, std::string& content) {
@@ -121,31 +97,8 @@ void write_event_record(event_type type, const char* text) {
     syslog(priority, "%s", text);
 }
 
-void close_descriptor(int fd) {
-    if (fd >= 0)
-        close(fd);
-}
-
-os_error make_ipc_pair(int& ours, int& theirs) {
-    int fds[2];
-    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) == -1)
-        return {errno, "socketpair"};
-    ours = fds[0];
-    theirs = fds[1];
-    return {};
-}
-
-os_error make_pipe(int& read_end, int& write_end) {
-    int fds[2];
-    if (pipe2(fds, O_CLOEXEC) == -1)
-        return {errno, "pipe2"};
-    read_end = fds[0];
-    write_end = fds[1];
-    return {};
-}
-
-bool descriptor_is_open(int fd) {
-    return fd >= 0 && fcntl(fd, F_GETFD) != -1;
+void close_handle(native_handle handle) {
+    close(handle);
 }
 
 } // namespace torvad::platform

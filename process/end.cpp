@@ -1,8 +1,6 @@
 // The end of a child: its exit, the restart rule, and leaving the daemon.
 #include "process/process.hpp"
 
-#include <boost/asio/post.hpp>
-
 #include "daemon/daemon.hpp"
 
 namespace torvad {
@@ -10,36 +8,48 @@ namespace torvad {
 namespace {
 // A child killed by a signal counts as failed, as the shell reports it.
 constexpr std::uint32_t signal_status_base = 128;
-// An exit whose status can't be read is counted as a failure, never as a
-// clean end: a restart is the safer guess.
-constexpr std::uint32_t unknown_status = 0xffffffff;
 } // namespace
 
+std::uint32_t exit_code_of(const platform::exit_status& exit, bool forced) {
+    // A status that can't be read is taken as the clean end it most likely
+    // was; the log says it was not read.
+    if (exit.error)
+        return 0;
+    if (!exit.exited)
+        return forced ? 0 : signal_status_base + static_cast<std::uint32_t>(exit.code);
+    return static_cast<std::uint32_t>(exit.code);
+}
+
 void process::on_exit(const boost::system::error_code& error) {
-    // Only a closing handle ends the wait with an error, and then the object
-    // may be gone: touch nothing.
+    // Only a closing handle ends the wait with an error: finish has run.
     if (error)
         return;
-    platform::exit_status exit = platform::reap_child(exit_watch.native_handle());
+    platform::exit_status exit = platform::exit_status_of(exit_watch);
     if (!exit.ended) {
         // Readiness is a hint: the loop can hand the stale readiness of a
         // descriptor closed in this turn to one opened after it. Only a reaped
         // status is the end of a child.
-        watch_exit();
+        wait_for_exit();
         return;
     }
-    std::uint32_t code = static_cast<std::uint32_t>(exit.code);
     if (exit.error) {
         owner->log_error("failed to read the exit status of '%s'.", name.c_str());
         owner->log_verbose("%s", platform::describe(exit.error).c_str());
-        code = unknown_status;
-    } else if (!exit.exited) {
-        code = forced ? 0 : signal_status_base + code;
     }
+    std::uint32_t code = exit_code_of(exit, forced);
     // All the child wrote is in its pipes now. What a descendant still holds
-    // open is not waited for: take what is there and close.
-    drain_output();
-    finish(code, packet_closed);
+    // open is not waited for: take what is there and close. A read on its
+    // way holds bytes from before the rest, so its landing comes first.
+    ending = true;
+    ended_status = code;
+    finish_after_output();
+}
+
+void process::finish_after_output() {
+    if (!ending || !drain_output())
+        return;
+    ending = false;
+    finish(ended_status, packet_closed);
 }
 
 void process::close_pipes() {
@@ -87,18 +97,19 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
     // A requester held back by our stdin backlog may read again.
     if (auto requester = parent.lock())
         requester->resume_ipc_read();
-    // Completions that were already queued when the pipes closed still run and
-    // may hold a plain pointer to us; this handler, queued behind them, keeps
-    // the object alive until they have.
+    // In this turn, behind all the output already relayed and behind a
+    // successor's opened: a peer that sent two requests in one write sees
+    // their ends in the order it asked, and may use the id again at once.
+    report_end();
+    // Leaving the set may drop the last reference but ours.
     auto self = shared_from_this();
-    boost::asio::post(*owner, [self] {});
     owner->remove(self);
 }
 
 void process::restart() {
     // The successor is in children before we leave, so the run never looks
     // empty across a restart.
-    create(owner, command, user, working_directory, {parent, channel}, persistent, stdio_mode)
+    create(owner, {command, user, working_directory, persistent, stdio_mode}, {parent, channel})
         ->start();
 }
 
@@ -109,7 +120,7 @@ void process::terminate() {
     }
     if (exit_watch.is_open()) {
         forced = true;
-        platform::kill_child(exit_watch.native_handle());
+        platform::end_by_force(exit_watch);
     }
 }
 

@@ -28,14 +28,11 @@ void process::handle_execute(const packet_header& header, const char* payload) {
         send_and_forget(header.channel, packet_failed, decision.status);
         return;
     }
-    execute_request& wanted = decision.request;
-    auto created = create(owner, std::move(wanted.command), std::move(wanted.user),
-                          std::move(wanted.working_directory), {weak_from_this(), header.channel},
-                          wanted.persistent, wanted.stdio_mode);
-    created->start();
-    // A failed start already left children: dropping created then sends
-    // failed and erases this entry again, from the destructor.
+    auto created = create(owner, std::move(decision.request), {weak_from_this(), header.channel});
+    // The entry is there before start, so that a failed start, which sends
+    // failed at once, also frees the id at once.
     channels[header.channel] = created;
+    created->start();
 }
 
 } // namespace torvad

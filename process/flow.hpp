@@ -13,8 +13,7 @@ constexpr std::size_t ipc_low_mark = 64 * 1024;
 // An ipc pipe is not read while a channel it feeds holds this much stdin.
 constexpr std::size_t stdin_high_mark = 256 * 1024;
 constexpr std::size_t stdin_low_mark = 64 * 1024;
-// A relayed read is at most this much, and becomes one packet.
-constexpr std::size_t relay_read_size = 4096;
+// A relayed read (at most 4096 bytes, the seam's) becomes one packet.
 constexpr int relay_reads_per_wake = 16;
 
 } // namespace torvad

@@ -2,35 +2,21 @@
 // and framing what comes in, and the queue of what goes out.
 #include "process/process.hpp"
 
-#include <cerrno>
-
 #include "daemon/daemon.hpp"
 #include "ipc/trace.hpp"
 #include "process/flow.hpp"
 
 namespace torvad {
 
-platform::os_error process::create_ipc_pipe(int& theirs) {
-    int ours = -1;
-    platform::os_error error = platform::make_ipc_pair(ours, theirs);
+platform::os_error process::create_ipc_pipe(platform::owned_handle& theirs) {
+    platform::os_error error = platform::make_ipc_pipe(ipc_pipe, theirs);
     if (!error)
-        error = own_descriptor(ipc_pipe, ours);
-    if (error) {
-        if (!ipc_pipe.is_open())
-            platform::close_descriptor(ours);
-        platform::close_descriptor(theirs);
-        theirs = -1;
-        return error;
-    }
-    ipc_in = std::make_unique<framer>();
-    return {};
+        ipc_in = std::make_unique<framer>();
+    return error;
 }
 
-void process::attach(std::int32_t attach_pid, int fd) {
-    platform::os_error error{EBADF, "fcntl"};
-    if (platform::descriptor_is_open(fd))
-        error = own_descriptor(ipc_pipe, fd);
-    if (error) {
+void process::attach(std::int32_t attach_pid, std::int64_t handle_value) {
+    if (platform::os_error error = platform::attach_pipe(ipc_pipe, handle_value)) {
         owner->log_error("failed to attach to ipc pipe.");
         owner->log_verbose("%s", platform::describe(error).c_str());
         return;
@@ -117,21 +103,24 @@ void process::pump_ipc() {
     if (ipc_queue.empty() || !ipc_pipe.is_open())
         return;
     ipc_writing = true;
-    // A write holds a plain pointer: see pump_stdin.
     ipc_pipe.async_write_some(
-        ipc_queue.front(), [this](const boost::system::error_code& error, std::size_t bytes) {
-            if (error)
-                return;
-            ipc_queue.consume(bytes);
-            pump_ipc();
-            if (ipc_queue.size() < ipc_low_mark && !waiting_for_room.empty()) {
-                auto waiting = std::move(waiting_for_room);
-                waiting_for_room.clear();
-                for (const auto& weak : waiting)
-                    if (auto writer = weak.lock())
-                        writer->resume_output();
-            }
+        ipc_queue.front(),
+        [self = shared_from_this()](const boost::system::error_code& error, std::size_t bytes) {
+            if (!error)
+                self->on_ipc_written(bytes);
         });
+}
+
+void process::on_ipc_written(std::size_t bytes) {
+    ipc_queue.consume(bytes);
+    pump_ipc();
+    if (ipc_queue.size() < ipc_low_mark && !waiting_for_room.empty()) {
+        auto waiting = std::move(waiting_for_room);
+        waiting_for_room.clear();
+        for (const auto& weak : waiting)
+            if (auto writer = weak.lock())
+                writer->resume_output();
+    }
 }
 
 bool process::ipc_backlogged() const {

@@ -5,6 +5,7 @@
 #include <boost/filesystem/path.hpp>
 
 #include "daemon/daemon.hpp"
+#include "ipc/strings.hpp"
 
 namespace torvad {
 
@@ -32,6 +33,15 @@ platform::os_error resolve_executable(std::vector<std::string>& argv) {
     return error;
 }
 
+// The command line as Windows takes it: each element in double quotes, a
+// double quote in it behind a backslash, joined by blanks.
+std::string command_line_of(const std::vector<std::string>& argv) {
+    std::string line;
+    for (const auto& argument : argv)
+        line += (line.empty() ? "" : " ") + quote_argument(argument, "\"");
+    return line;
+}
+
 } // namespace
 
 bool process::fail_launch(std::uint32_t failure_status, const platform::os_error& error) {
@@ -41,43 +51,24 @@ bool process::fail_launch(std::uint32_t failure_status, const platform::os_error
     return false;
 }
 
-platform::os_error own_descriptor(descriptor& object, int fd) {
-    boost::system::error_code failure;
-    object.assign(fd, failure);
-    if (!failure)
-        object.non_blocking(true, failure);
-    return failure ? platform::os_error{failure.value(), "assign"} : platform::os_error{};
-}
-
-bool process::prepare_stdio(platform::launch_request& request) {
+bool process::prepare_stdio(platform::launch_request& request,
+                            platform::owned_handle (&theirs)[3]) {
     if (stdio_mode == stdio_none)
-        request.stdio = platform::stdio_source::null_device;
+        request.stdio = platform::stdio_source::none;
     if (stdio_mode != stdio_pipes)
         return true;
-    request.stdio = platform::stdio_source::descriptors;
-    // The child reads its stdin and writes its stdout and stderr; ours are
-    // the other ends.
-    int ours[3] = {-1, -1, -1};
-    platform::os_error error;
-    for (int stream = 0; stream < 3 && !error; ++stream) {
-        int read_end = -1, write_end = -1;
-        error = platform::make_pipe(read_end, write_end);
-        ours[stream] = stream == 0 ? write_end : read_end;
-        request.stdio_fds[stream] = stream == 0 ? read_end : write_end;
-    }
-    descriptor* pipes[3] = {&stdin_pipe, &stdout_pipe, &stderr_pipe};
-    for (int stream = 0; stream < 3 && !error; ++stream)
-        error = own_descriptor(*pipes[stream], ours[stream]);
-    if (!error)
-        return true;
+    request.stdio = platform::stdio_source::handles;
+    platform::stream* ours[3] = {&stdin_pipe, &stdout_pipe, &stderr_pipe};
     for (int stream = 0; stream < 3; ++stream) {
-        if (!pipes[stream]->is_open())
-            platform::close_descriptor(ours[stream]);
-        platform::close_descriptor(request.stdio_fds[stream]);
+        if (platform::os_error error =
+                platform::make_relay_pipe(stream, *ours[stream], theirs[stream])) {
+            close_pipes();
+            owner->log_error("failed to create child process.");
+            return fail_launch(error.code, error);
+        }
+        request.stdio_handles[stream] = theirs[stream].get();
     }
-    close_pipes();
-    owner->log_error("failed to create child process.");
-    return fail_launch(error.code, error);
+    return true;
 }
 
 bool process::start() {
@@ -95,36 +86,34 @@ bool process::start() {
         return fail_launch(status_not_found, error);
     }
     platform::launch_request request;
-    if (!prepare_stdio(request))
+    // The child's ends: it inherits its copies at the launch, ours go with these.
+    platform::owned_handle child_stdio[3], child_ipc;
+    if (!prepare_stdio(request, child_stdio))
         return false;
     if (persistent) {
-        if (platform::os_error error = create_ipc_pipe(request.ipc_fd)) {
-            for (int fd : request.stdio_fds)
-                platform::close_descriptor(fd);
+        if (platform::os_error error = create_ipc_pipe(child_ipc)) {
             owner->log_error("failed to create ipc pipe.");
             return fail_launch(error.code, error);
         }
-        argv.push_back(std::to_string(platform::child_ipc_fd(request.ipc_fd)));
+        request.ipc = child_ipc.get();
+        argv.push_back(std::to_string(platform::handle_value(child_ipc.get())));
     }
-    int logon_error = user.empty() ? 0 : platform::resolve_account(user, request.user);
-    platform::launch_result launched;
-    if (logon_error == 0) {
-        request.executable = argv[0];
-        request.argv = std::move(argv);
-        request.working_directory = working_directory;
-        // At a console the terminal signals its whole foreground group; only
-        // we are to hear Ctrl-C, and stop the children in order.
-        request.own_process_group = !background;
-        launched = platform::launch_child(request);
-        if (launched.failed_step == platform::launch_step::logon)
-            logon_error = launched.error.code;
-    }
+    request.executable = argv[0];
+    request.command_line = command_line_of(argv);
+    request.argv = std::move(argv);
+    request.working_directory = working_directory;
+    request.user = user;
+    // At a console the terminal signals its whole foreground group; only
+    // we are to hear Ctrl-C, and stop the children in order.
+    request.own_process_group = !background;
+    platform::launch_result launched = platform::launch_child(request);
     // The child has its copies of these now, or never will.
-    platform::close_descriptor(request.ipc_fd);
-    for (int fd : request.stdio_fds)
-        platform::close_descriptor(fd);
-    if (logon_error != 0) {
-        owner->log_warning("Failed to logon as user '%s': error %d", user.c_str(), logon_error);
+    child_ipc.reset();
+    for (auto& end : child_stdio)
+        end.reset();
+    if (launched.failed_step == platform::launch_step::logon) {
+        owner->log_warning("Failed to logon as user '%s': error %d", user.c_str(),
+                           launched.error.code);
         return fail_launch(status_not_found, launched.error);
     }
     if (launched.failed_step != platform::launch_step::none) {
@@ -135,19 +124,17 @@ bool process::start() {
     return true;
 }
 
-void process::watch_child(const platform::launch_result& launched) {
-    boost::system::error_code failure;
-    exit_watch.assign(launched.pidfd, failure);
+void process::watch_child(platform::launch_result& launched) {
     pid = static_cast<std::uint32_t>(launched.pid);
-    if (failure) {
-        // Without its pidfd in the loop we could never see the exit: end the
+    if (platform::os_error error = platform::watch_exit(exit_watch, launched.process)) {
+        // Without its exit in the loop we could never see it end: end the
         // child now rather than leave it unwatched.
-        platform::end_child_now(launched.pidfd);
+        platform::end_now(launched.process);
         owner->log_error("failed to create child process.");
-        fail_launch(failure.value(), {failure.value(), "assign"});
+        fail_launch(error.code, error);
         return;
     }
-    watch_exit();
+    wait_for_exit();
     if (stdio_mode == stdio_pipes) {
         wait_output(1);
         wait_output(2);
@@ -160,11 +147,11 @@ void process::watch_child(const platform::launch_result& launched) {
         requester->send_packet(channel, packet_opened, pid, nullptr, 0);
 }
 
-void process::watch_exit() {
-    // The exit wait holds a plain pointer: it must not keep the object alive,
-    // and it only completes successfully while the object is in children.
-    exit_watch.async_wait(descriptor::wait_read,
-                          [this](const boost::system::error_code& error) { on_exit(error); });
+void process::wait_for_exit() {
+    platform::await_exit(exit_watch,
+                         [self = shared_from_this()](const boost::system::error_code& error) {
+                             self->on_exit(error);
+                         });
 }
 
 } // namespace torvad

@@ -8,31 +8,24 @@
 
 namespace torvad {
 
-process::process(daemon* owner, std::vector<std::string> command, std::string user,
-                 std::string working_directory, channel_ref ref, bool persistent,
-                 std::int32_t stdio_mode)
-    : owner(owner), command(std::move(command)), user(std::move(user)),
-      working_directory(std::move(working_directory)), parent(std::move(ref.parent)),
-      channel(ref.channel), persistent(persistent), stdio_mode(stdio_mode),
+process::process(daemon* owner, execute_request what, channel_ref ref)
+    : owner(owner), command(std::move(what.command)), user(std::move(what.user)),
+      working_directory(std::move(what.working_directory)), parent(std::move(ref.parent)),
+      channel(ref.channel), persistent(what.persistent), stdio_mode(what.stdio_mode),
       end_packet(packet_failed), exit_watch(owner->get_executor()),
       stdin_pipe(owner->get_executor()), stdout_pipe(owner->get_executor()),
       stderr_pipe(owner->get_executor()), ipc_pipe(owner->get_executor()) {
     // Pipes are relayed to a parent; without a living one there is nowhere to go.
-    if (this->stdio_mode == stdio_pipes && parent.expired())
-        this->stdio_mode = stdio_none;
-    if (!this->command.empty())
-        name = boost::filesystem::path(this->command[0]).filename().string();
+    if (stdio_mode == stdio_pipes && parent.expired())
+        stdio_mode = stdio_none;
+    if (!command.empty())
+        name = boost::filesystem::path(command[0]).filename().string();
     if (auto requester = parent.lock())
         requester->own_channels.insert(this);
 }
 
-std::shared_ptr<process> process::create(daemon* owner, std::vector<std::string> command,
-                                         std::string user, std::string working_directory,
-                                         channel_ref ref, bool persistent,
-                                         std::int32_t stdio_mode) {
-    std::shared_ptr<process> created(new process(owner, std::move(command), std::move(user),
-                                                 std::move(working_directory), std::move(ref),
-                                                 persistent, stdio_mode));
+std::shared_ptr<process> process::create(daemon* owner, execute_request what, channel_ref ref) {
+    std::shared_ptr<process> created(new process(owner, std::move(what), std::move(ref)));
     // The set is the owner from here on, so create never hands out a child
     // that the daemon doesn't know.
     owner->adopt(created);
@@ -40,8 +33,19 @@ std::shared_ptr<process> process::create(daemon* owner, std::vector<std::string>
 }
 
 process::~process() {
-    // Runs after every pending read has completed, so this packet follows all
-    // of the channel's output.
+    // Only an object that never reached finish (the daemon's teardown) still
+    // owes its parent the closing packet here.
+    report_end();
+}
+
+std::string process::description() const {
+    return "'" + name + "' (pid " + std::to_string(pid) + ")";
+}
+
+void process::report_end() {
+    if (end_reported)
+        return;
+    end_reported = true;
     if (auto requester = parent.lock()) {
         requester->send_packet(channel, end_packet, status, nullptr, 0);
         requester->channels.erase(channel);

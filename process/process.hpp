@@ -3,15 +3,12 @@
 //
 // Who keeps a process alive:
 // - The daemon's set of children owns it, from create() to daemon::remove().
-// - Each pending read (of the ipc pipe, or a wait for a relayed output pipe)
-//   holds shared_from_this(): the closing packet of a channel, sent by the
-//   destructor, can only follow output that was already read.
-// - The exit wait and the writes hold a plain pointer and act only on
-//   success: they must not keep the object alive, and they can't complete
-//   successfully once finish() has closed their descriptor.
-// - finish() posts a handler holding shared_from_this() behind whatever
-//   completion was already queued when it closed the descriptors, so such a
-//   completion never meets a freed object.
+// - Every pending operation of its own (the exit wait, the reads of its ipc
+//   pipe and relayed output, the writes) holds shared_from_this(). finish()
+//   closes all of them, so once it has run nothing keeps the object but
+//   completions already on their way, which carry no output: finish runs
+//   only once the output pipes are drained, and sends a channel's closing
+//   packet in that same turn.
 // Parent and channel know each other by weak_ptr alone. The daemon must
 // outlive every process.
 #pragma once
@@ -22,9 +19,6 @@
 #include <string>
 #include <unordered_set>
 #include <vector>
-
-#include <boost/asio/io_context.hpp>
-#include <boost/asio/posix/stream_descriptor.hpp>
 
 #include "ipc/execute.hpp"
 #include "ipc/framer.hpp"
@@ -42,18 +36,16 @@ struct channel_ref {
     std::uint32_t channel = 0;
 };
 
-using descriptor =
-    boost::asio::posix::basic_stream_descriptor<boost::asio::io_context::executor_type>;
-
-// Takes fd into object, non-blocking; on failure fd is still the caller's.
-platform::os_error own_descriptor(descriptor& object, int fd);
+// The code a reaped child's end counts as: its exit status, 128 + the signal
+// of a death by signal (0 when we forced it), and 0 when it can't be read.
+std::uint32_t exit_code_of(const platform::exit_status& exit, bool forced);
 
 class process : public std::enable_shared_from_this<process> {
   public:
-    static std::shared_ptr<process> create(daemon* owner, std::vector<std::string> command,
-                                           std::string user, std::string working_directory,
-                                           channel_ref ref, bool persistent,
-                                           std::int32_t stdio_mode);
+    // What to run and how: a top-level program's options, or a channel's
+    // request; ref is the channel's place on its requester's pipe.
+    static std::shared_ptr<process> create(daemon* owner, execute_request what,
+                                           channel_ref ref = {});
     ~process();
     process(const process&) = delete;
     process& operator=(const process&) = delete;
@@ -62,12 +54,14 @@ class process : public std::enable_shared_from_this<process> {
     // left the daemon's set). (process/launch.cpp)
     bool start();
     // Serves a pipe another program made instead of launching. (process/ipc_pipe.cpp)
-    void attach(std::int32_t attach_pid, int fd);
+    void attach(std::int32_t attach_pid, std::int64_t handle_value);
     // Asks a persistent child to stop with sigterm, ends any other by force.
     void terminate();
     void close_pipes();
     // close_pipes on every channel of this process, a restarted one included.
     void close_channel_pipes();
+    // "'name' (pid N)", for a log line.
+    std::string description() const;
 
     daemon* const owner;
     const std::vector<std::string> command;
@@ -78,26 +72,30 @@ class process : public std::enable_shared_from_this<process> {
     const bool persistent;
 
   private:
-    process(daemon* owner, std::vector<std::string> command, std::string user,
-            std::string working_directory, channel_ref ref, bool persistent,
-            std::int32_t stdio_mode);
+    process(daemon* owner, execute_request what, channel_ref ref);
 
     // launch (process/launch.cpp)
     bool fail_launch(std::uint32_t status, const platform::os_error& error);
-    bool prepare_stdio(platform::launch_request& request);
-    void watch_child(const platform::launch_result& launched);
-    void watch_exit();
+    bool prepare_stdio(platform::launch_request& request, platform::owned_handle (&theirs)[3]);
+    void watch_child(platform::launch_result& launched);
+    void wait_for_exit();
 
     // end (process/end.cpp)
     void on_exit(const boost::system::error_code& error);
+    void finish_after_output();
     void finish(std::uint32_t status, std::uint32_t end_packet);
+    // Sends the parent end_packet with status and frees the channel id, once.
+    void report_end();
     void restart();
 
     // relayed standard streams (process/streams.cpp)
+    platform::stream& output_pipe(int stream);
+    platform::output_buffer& output_buffer_of(int stream);
     void wait_output(int stream);
+    void on_output(int stream, const boost::system::error_code& error);
     boost::system::error_code forward_output(int stream, process* requester);
     void relay_output(int stream);
-    void drain_output();
+    bool drain_output();
     void resume_output();
     void write_stdin(const char* data, std::uint32_t size, bool close);
     void pump_stdin();
@@ -105,7 +103,7 @@ class process : public std::enable_shared_from_this<process> {
     void count_stdin_backlog();
 
     // the ipc pipe (process/ipc_pipe.cpp)
-    platform::os_error create_ipc_pipe(int& theirs);
+    platform::os_error create_ipc_pipe(platform::owned_handle& theirs);
     void read_ipc();
     void on_ipc_read(const boost::system::error_code& error, std::size_t bytes);
     void on_packet(const packet_header& header, const char* payload);
@@ -113,6 +111,7 @@ class process : public std::enable_shared_from_this<process> {
     void send_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
                      const void* data, std::uint32_t size);
     void pump_ipc();
+    void on_ipc_written(std::size_t bytes);
     bool ipc_backlogged() const;
     void wait_for_room(const std::shared_ptr<process>& writer);
     void resume_ipc_read();
@@ -128,26 +127,33 @@ class process : public std::enable_shared_from_this<process> {
     std::uint32_t pid = 0;
     std::uint32_t end_packet;
     std::uint32_t status = 0;
-    bool forced = false;   // terminate ended the child by force: its end counts as 0
-    descriptor exit_watch; // the child's pidfd
+    bool forced = false; // terminate ended the child by force: its end counts as 0
+    bool end_reported = false;
+    // The child has ended and a read was on its way: its status waits here
+    // until that read has landed and the pipes are drained behind it.
+    bool ending = false;
+    std::uint32_t ended_status = 0;
+    platform::exit_watch exit_watch;
 
-    descriptor stdin_pipe, stdout_pipe, stderr_pipe; // our ends of the relayed streams
+    platform::stream stdin_pipe, stdout_pipe, stderr_pipe; // our ends of the relayed streams
+    platform::output_buffer output_buffers[2];             // stdout's, stderr's
     byte_queue stdin_queue;
     bool stdin_writing = false;
     bool stdin_close_requested = false;
     bool stdin_counted = false;                    // in the requester's backlogged_channels
     bool output_paused[3] = {false, false, false}; // by stream number, 1 and 2
 
-    descriptor ipc_pipe;
+    platform::stream ipc_pipe;
     std::unique_ptr<framer> ipc_in; // made with the pipe: channels have none
     byte_queue ipc_queue;
     bool ipc_writing = false;
     bool ipc_read_paused = false; // a channel's stdin backlog holds the reads back
     std::map<std::uint32_t, std::weak_ptr<process>> channels;
-    // Every process made as a channel of this one and not yet destroyed: a
-    // restarted channel has left `channels` at its predecessor's end, but is
-    // still ours. Each enters in its constructor and leaves in its destructor,
-    // so a plain pointer here is always to a living object.
+    // Every process made as a channel of this one that has not reported its
+    // end: a restarted channel has left `channels` at its predecessor's end,
+    // but is still ours. Each enters in its constructor and leaves in
+    // report_end, at the latest from its destructor, so a plain pointer here
+    // is always to a living object.
     std::unordered_set<process*> own_channels;
     std::vector<std::weak_ptr<process>> waiting_for_room; // channels paused on our queue
     std::size_t backlogged_channels = 0;                  // channels whose stdin is over its mark

@@ -8,35 +8,45 @@
 
 namespace torvad {
 
-namespace {
-// Only one handler runs at a time and a read is copied into a packet at
-// once, so every channel reads into this one buffer: an idle channel holds
-// none of its own.
-char relay_buffer[relay_read_size];
-} // namespace
+platform::stream& process::output_pipe(int stream) {
+    return stream == 1 ? stdout_pipe : stderr_pipe;
+}
+
+platform::output_buffer& process::output_buffer_of(int stream) {
+    return output_buffers[stream - 1];
+}
 
 void process::wait_output(int stream) {
-    descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
     // The wait owns the object until it completes, so the closing packet of a
     // channel can only follow output that was already read.
-    pipe.async_wait(descriptor::wait_read,
-                    [self = shared_from_this(), stream](const boost::system::error_code& error) {
-                        if (!error)
-                            self->relay_output(stream);
-                    });
+    platform::await_output(
+        output_pipe(stream), output_buffer_of(stream),
+        [self = shared_from_this(), stream](const boost::system::error_code& error) {
+            self->on_output(stream, error);
+        });
+}
+
+void process::on_output(int stream, const boost::system::error_code& error) {
+    // The child has ended, and this read was what its end waited for.
+    if (ending)
+        finish_after_output();
+    else if (!error)
+        relay_output(stream);
 }
 
 // One read of stream, as one packet to the requester (dropped without one).
 // A stream that ends or fails is closed; would_block leaves it open.
 boost::system::error_code process::forward_output(int stream, process* requester) {
-    descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
-    boost::system::error_code error;
-    std::size_t bytes = pipe.read_some(boost::asio::buffer(relay_buffer), error);
+    platform::stream& pipe = output_pipe(stream);
+    const char* data = nullptr;
+    std::size_t bytes = 0;
+    boost::system::error_code error =
+        platform::take_output(pipe, output_buffer_of(stream), data, bytes);
     if (error && error != boost::asio::error::would_block) {
         boost::system::error_code ignored;
         pipe.close(ignored);
     } else if (!error && requester) {
-        requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0, relay_buffer,
+        requester->send_packet(channel, static_cast<std::uint32_t>(stream), 0, data,
                                static_cast<std::uint32_t>(bytes));
     }
     return error;
@@ -74,15 +84,24 @@ void process::resume_output() {
 }
 
 // The child is gone, so what is in its pipes is all there will be from it;
-// the queue's mark doesn't hold this back, the pipes' size bounds it.
-void process::drain_output() {
+// the queue's mark doesn't hold this back, the pipes' size bounds it. False
+// while a read is still on its way: it is cut short, and its landing calls
+// this again.
+bool process::drain_output() {
     auto requester = parent.lock();
+    bool drained = true;
     for (int stream : {1, 2}) {
-        descriptor& pipe = stream == 1 ? stdout_pipe : stderr_pipe;
+        platform::stream& pipe = output_pipe(stream);
+        if (platform::output_in_flight(output_buffer_of(stream))) {
+            platform::cut_output_short(pipe);
+            drained = false;
+            continue;
+        }
         while (pipe.is_open() && !forward_output(stream, requester.get())) {
         }
         output_paused[stream] = false;
     }
+    return drained;
 }
 
 void process::write_stdin(const char* data, std::uint32_t size, bool close) {
@@ -109,25 +128,25 @@ void process::pump_stdin() {
         return;
     }
     stdin_writing = true;
-    // A write holds a plain pointer: it must not keep the object alive. When
-    // finish closed the pipe it completes as aborted and touches nothing; any
-    // other failure is the child's end gone, seen while we are in the set.
-    stdin_pipe.async_write_some(stdin_queue.front(),
-                                [this](const boost::system::error_code& error, std::size_t n) {
-                                    if (error == boost::asio::error::operation_aborted)
-                                        return;
-                                    if (error) {
-                                        boost::system::error_code ignored;
-                                        stdin_pipe.close(ignored);
-                                        stdin_queue.clear();
-                                    }
-                                    stdin_queue.consume(n);
-                                    count_stdin_backlog();
-                                    pump_stdin();
-                                    if (stdin_queue.size() < stdin_low_mark)
-                                        if (auto requester = parent.lock())
-                                            requester->resume_ipc_read();
-                                });
+    // When finish closed the pipe the write completes as aborted and touches
+    // nothing; any other failure is the child's end gone.
+    stdin_pipe.async_write_some(
+        stdin_queue.front(),
+        [self = shared_from_this()](const boost::system::error_code& error, std::size_t n) {
+            if (error == boost::asio::error::operation_aborted)
+                return;
+            if (error) {
+                boost::system::error_code ignored;
+                self->stdin_pipe.close(ignored);
+                self->stdin_queue.clear();
+            }
+            self->stdin_queue.consume(n);
+            self->count_stdin_backlog();
+            self->pump_stdin();
+            if (self->stdin_queue.size() < stdin_low_mark)
+                if (auto requester = self->parent.lock())
+                    requester->resume_ipc_read();
+        });
 }
 
 bool process::stdin_backlogged() const {

@@ -4,9 +4,9 @@
 // the next boot, like a one-time task), reloads, and starts the service. core
 // is then a plain service of the manager: it need not speak the notify
 // protocol that torvad speaks.
-#include "entry/handover.hpp"
+#include "platform/platform.hpp"
 
-namespace torvad {
+namespace torvad::platform {
 
 namespace {
 
@@ -60,13 +60,11 @@ std::string job_script(const std::string& service_name, const std::string& core_
            "systemctl start torvaSentryServer\n";
 }
 
-} // namespace
-
+// The timer's default accuracy is a minute; the job is meant for 10 s.
+// Without a description the manager takes the whole script for one, and
+// its lines break the transient unit's file at every reload.
 std::vector<std::string> systemd_run_arguments(const std::string& service_name,
                                                const std::string& core_path) {
-    // The timer's default accuracy is a minute; the job is meant for 10 s.
-    // Without a description the manager takes the whole script for one, and
-    // its lines break the transient unit's file at every reload.
     return {"--unit=startts",
             "--description=hand the service over to core",
             "--collect",
@@ -79,4 +77,13 @@ std::vector<std::string> systemd_run_arguments(const std::string& service_name,
             escape_variables(job_script(service_name, core_path))};
 }
 
-} // namespace torvad
+} // namespace
+
+bool schedule_handover_job(const std::string& service_name, const std::string& core_path) {
+    std::string tool = search_path("systemd-run");
+    return !tool.empty() && run_program(tool, systemd_run_arguments(service_name, core_path),
+                                        returned_stream::none, {})
+                                    .error == 0;
+}
+
+} // namespace torvad::platform

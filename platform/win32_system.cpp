@@ -1,0 +1,132 @@
+// The supervisor's own process, its files, its console and the event log on
+// Windows.
+#include <windows.h>
+
+#include <direct.h>
+#include <exception>
+#include <fcntl.h>
+#include <io.h>
+
+#include "platform/platform.hpp"
+
+namespace torvad::platform {
+
+const char* const exe_suffix = ".exe";
+
+std::string describe(const os_error& error) {
+    char text[512];
+    DWORD length =
+        FormatMessageA(FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS, nullptr,
+                       static_cast<DWORD>(error.code), 0, text, sizeof text, nullptr);
+    // The system's texts end in a line break of their own.
+    while (length > 0 && (text[length - 1] == '\n' || text[length - 1] == '\r'))
+        --length;
+    std::string reason = length > 0 ? std::string(text, length)
+                                    : "error " + std::to_string(static_cast<DWORD>(error.code));
+    return std::string(error.call) + ": " + reason;
+}
+
+// Windows starts us as we are: standard handles that are missing stay null,
+// and a child's end is seen on its process handle, not by a signal.
+void prepare_own_process() {}
+
+void unbuffer_output() {
+    // The runtime knows no line buffering, so nothing is buffered; and a line
+    // ends in a line feed alone, as the log's formats give it, also in a file.
+    std::setvbuf(stdout, nullptr, _IONBF, 0);
+    _setmode(_fileno(stdout), _O_BINARY);
+    _setmode(_fileno(stderr), _O_BINARY);
+}
+
+int current_process_id() {
+    return static_cast<int>(GetCurrentProcessId());
+}
+
+bool stdout_is_terminal() {
+    return _isatty(_fileno(stdout)) != 0;
+}
+
+// A console takes escape sequences once it is told to process them; output
+// that isn't a console has no mode to read.
+bool console_takes_colour() {
+    HANDLE output = GetStdHandle(STD_OUTPUT_HANDLE);
+    DWORD mode = 0;
+    if (!GetConsoleMode(output, &mode))
+        return false;
+    return SetConsoleMode(output, mode | ENABLE_VIRTUAL_TERMINAL_PROCESSING) != 0;
+}
+
+bool change_directory(const std::string& path) {
+    return _chdir(path.c_str()) == 0;
+}
+
+std::tm local_time_now() {
+    __time64_t now = _time64(nullptr);
+    std::tm local{};
+    _localtime64_s(&local, &now);
+    return local;
+}
+
+os_error read_file(const std::string& path, std::string& content) {
+    HANDLE file = CreateFileA(path.c_str(), GENERIC_READ, FILE_SHARE_READ | FILE_SHARE_WRITE,
+                              nullptr, OPEN_EXISTING, FILE_ATTRIBUTE_NORMAL, nullptr);
+    if (file == INVALID_HANDLE_VALUE)
+        return {static_cast<int>(GetLastError()), "CreateFileA"};
+    owned_handle owner(file);
+    char buffer[65536];
+    for (;;) {
+        DWORD got = 0;
+        if (!ReadFile(file, buffer, sizeof buffer, &got, nullptr))
+            return {static_cast<int>(GetLastError()), "ReadFile"};
+        if (got == 0)
+            return {};
+        content.append(buffer, got);
+    }
+}
+
+void close_handle(native_handle handle) {
+    CloseHandle(handle);
+}
+
+namespace {
+
+struct task {
+    const std::function<void()>& work;
+    std::exception_ptr failure;
+};
+
+DWORD WINAPI run_task(void* argument) {
+    auto* job = static_cast<task*>(argument);
+    try {
+        job->work();
+    } catch (...) {
+        job->failure = std::current_exception();
+    }
+    return 0;
+}
+
+} // namespace
+
+// The stack is reserved, its pages committed as deep as the work goes.
+bool run_on_large_stack(std::size_t stack_bytes, const std::function<void()>& work) {
+    task job{work, nullptr};
+    HANDLE thread = CreateThread(nullptr, stack_bytes, run_task, &job,
+                                 STACK_SIZE_PARAM_IS_A_RESERVATION, nullptr);
+    if (thread == nullptr)
+        return false;
+    WaitForSingleObject(thread, INFINITE);
+    CloseHandle(thread);
+    if (job.failure)
+        std::rethrow_exception(job.failure);
+    return true;
+}
+
+void write_event_record(event_type type, const char* text) {
+    // Opened once, by whichever thread logs first; the static's guard makes
+    // the others wait for it. A failed opening is not tried again.
+    static const HANDLE source = RegisterEventSourceA(nullptr, "torvad");
+    const char* strings[] = {"torvad", text};
+    ReportEventA(source, static_cast<WORD>(type), 0, 0, nullptr, 2, 0, strings, nullptr);
+}
+
+} // namespace torvad::platform
