@@ -17,11 +17,15 @@ void daemon::log_line(event_type type, int colour_number, const char* format, va
     char text[log_buffer_size];
     std::vsnprintf(text, sizeof text, format, args);
     std::tm now = platform::local_time_now();
-    if (colour_)
-        std::printf("\x1b[3%dm%02d:%02d:%02d\x1b[36m torvad\x1b[0m %s\n", colour_number,
-                    now.tm_hour, now.tm_min, now.tm_sec, text);
-    else
-        std::printf("%02d:%02d:%02d torvad %s\n", now.tm_hour, now.tm_min, now.tm_sec, text);
+    // The line goes out in one write, so that it stands whole beside what the
+    // children write to the same console, on a runtime without line buffering too.
+    char line[log_buffer_size + 64];
+    int length = colour_ ? std::snprintf(line, sizeof line,
+                                         "\x1b[3%dm%02d:%02d:%02d\x1b[36m torvad\x1b[0m %s\n",
+                                         colour_number, now.tm_hour, now.tm_min, now.tm_sec, text)
+                         : std::snprintf(line, sizeof line, "%02d:%02d:%02d torvad %s\n",
+                                         now.tm_hour, now.tm_min, now.tm_sec, text);
+    std::fwrite(line, 1, static_cast<std::size_t>(length), stdout);
     if (logging)
         platform::write_event_record(type, text);
 }

@@ -7,9 +7,18 @@
 
 namespace child_host {
 
+namespace {
+// Ctrl-C at the console reaches every program on it; a peer ends by its
+// sigterm packet, as it does when torvad runs as a service.
+BOOL WINAPI ignore_interrupt(DWORD event) {
+    return event == CTRL_C_EVENT || event == CTRL_BREAK_EVENT;
+}
+} // namespace
+
 void prepare_streams() {
     for (int stream : {0, 1, 2})
         _setmode(stream, _O_BINARY);
+    SetConsoleCtrlHandler(ignore_interrupt, TRUE);
 }
 
 int own_pid() {

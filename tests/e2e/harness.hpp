@@ -13,6 +13,10 @@ namespace e2e {
 
 extern const char* const torvad_binary;
 extern const char* const child_binary;
+// How long the service dispatcher may take to refuse a program that the
+// service manager didn't start: at once on Linux, 10 s under Wine (see
+// harness_win32.cpp).
+extern const int dispatcher_refusal_ms;
 
 // Where a row of a table holds.
 enum class systems { both, linux_only, windows_only };
