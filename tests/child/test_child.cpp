@@ -88,7 +88,8 @@ int serve(const context& how, bool obey_sigterm) {
 // A peer whose report goes to the file FILE, for a run with no console to
 // write to (a service): its version, then how it ended.
 int mode_record(const context& how) {
-    std::ofstream report(how.args.empty() ? "record.log" : how.args[0], std::ios::app);
+    std::ofstream report(how.args.empty() ? "record.log" : how.args[0],
+                         std::ios::app | std::ios::binary);
     connection link(how.ipc_fd);
     peer::version_info version;
     if (!peer::read_version(link, version))
@@ -344,8 +345,10 @@ const mode modes[] = {
 } // namespace
 
 // Named "core" ("core.exe" on Windows), it stands in for the product's server
-// program: it answers -h with its version on stderr and otherwise reports as
-// the fds mode does.
+// program: it answers -h with its version on stderr (a file "silent" in its
+// working directory keeps the version back) and otherwise reports as the fds
+// mode does, or records as the record mode does to a file "core.log" that is
+// there, for a run with no console.
 bool is_core(const char* self) {
     std::string name = fs::path(self).filename().string();
     return name == "core" || name == "core.exe";
@@ -355,7 +358,12 @@ int main(int argc, char** argv) {
     child_host::prepare_streams();
     context how{argv[0], {}, peer::ipc_fd_from_arguments(argc, argv)};
     if (is_core(argv[0]) && argc > 1 && std::strcmp(argv[1], "-h") == 0)
-        return std::fputs("test_child version 1\n", stderr) < 0;
+        return std::fputs(fs::exists("silent") ? "usage: core\n" : "test_child version 1\n",
+                          stderr) < 0;
+    if (int code = child_host::stand_in_for_tool(argv[0]); code >= 0)
+        return code;
+    if (is_core(argv[0]) && fs::exists("core.log"))
+        return mode_record({argv[0], {"core.log"}, how.ipc_fd});
     if (is_core(argv[0]))
         return mode_fds(how);
     for (int i = 2; i < (how.ipc_fd >= 0 ? argc - 1 : argc); ++i)

@@ -222,6 +222,7 @@ struct daemon_run::system_part {
 // manager started last; that pipe is taken (by winedevice, at least), so it
 // waits out the pipe's 10 s before it fails with 1063.
 const int dispatcher_refusal_ms = 30000;
+const int event_wait_ms = 30000;
 
 bool holds_here(systems where) {
     return where != systems::linux_only;
