@@ -33,13 +33,14 @@ package: build
 	  DEBIAN_FRONTEND=noninteractive apt-get install -y dpkg-dev
 	cd build && cpack -G DEB
 
-# The format check, the sanitizer run and the fuzzers first, so the summary of
-# the plain run ends the output.
+# The format check, the sanitizer run, the fuzzers, the system test and the
+# Windows build's tests first, so the summary of the plain run ends the output.
 test: build
 	$(MAKE) format-check
 	$(MAKE) test-asan
 	$(MAKE) fuzz
 	$(MAKE) test-system
+	$(MAKE) test-windows
 	ctest --test-dir build --output-on-failure -j2
 
 # The package on a real systemd, booted in namespaces of its own over a
