@@ -91,6 +91,20 @@ void daemon::terminate_children() {
         if (child->parent.expired() || child->persistent)
             child->terminate();
     auto_restart = false;
+    // Nothing escalates after sigterm, so a stop asked for again can only
+    // say whom it is waiting for.
+    if (stop_requested_)
+        name_awaited_children();
+    stop_requested_ = true;
+}
+
+void daemon::name_awaited_children() {
+    std::string awaited;
+    for (const auto& child : children_)
+        if (child->persistent)
+            awaited += (awaited.empty() ? "" : ", ") + child->description();
+    if (!awaited.empty())
+        log_warning("still waiting for %s to end after sigterm.", awaited.c_str());
 }
 
 void daemon::stop() {

@@ -74,6 +74,7 @@ class daemon : public boost::asio::io_context {
     void log_line(event_type type, int colour_number, const char* format, va_list args);
     void load_patterns(const char* path);
     void terminate_children();
+    void name_awaited_children();
     void arm_signal_wait();
     void on_signal(const boost::system::error_code& error, int signal_number);
     void persistent_children_changed();
@@ -88,6 +89,7 @@ class daemon : public boost::asio::io_context {
     platform::stream orphan_watch_;
     pattern_lists patterns_;
     bool children_report_posted_ = false;
+    bool stop_requested_ = false;
 };
 
 // The supervisor of this program, built before main and gone after it.

@@ -23,6 +23,9 @@ void remove_file(const std::string& path) {
 }
 
 std::string absolute_path(const std::string& path, os_error& error) {
+    // An absolute name needs no current directory, which may have been deleted.
+    if (boost::filesystem::path(path).is_absolute())
+        return boost::filesystem::path(path).lexically_normal().string();
     boost::system::error_code failure;
     auto directory = boost::filesystem::current_path(failure);
     if (failure) {

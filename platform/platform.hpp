@@ -52,7 +52,8 @@ std::tm local_time_now();
 bool write_pid_file(const std::string& path, int pid);
 void remove_file(const std::string& path);
 // The absolute, normal form of path against the current directory; an error
-// when that directory can't be had (it may have been deleted).
+// when path is relative and that directory can't be had (it may have been
+// deleted).
 std::string absolute_path(const std::string& path, os_error& error);
 // The path of an executable found on PATH (with the extensions of PATHEXT on
 // Windows), or empty.

@@ -8,10 +8,17 @@ namespace torvad {
 namespace {
 // A child killed by a signal counts as failed, as the shell reports it.
 constexpr std::uint32_t signal_status_base = 128;
-// An exit whose status can't be read is counted as a failure, never as a
-// clean end: a restart is the safer guess.
-constexpr std::uint32_t unknown_status = 0xffffffff;
 } // namespace
+
+std::uint32_t exit_code_of(const platform::exit_status& exit, bool forced) {
+    // A status that can't be read is taken as the clean end it most likely
+    // was; the log says it was not read.
+    if (exit.error)
+        return 0;
+    if (!exit.exited)
+        return forced ? 0 : signal_status_base + static_cast<std::uint32_t>(exit.code);
+    return static_cast<std::uint32_t>(exit.code);
+}
 
 void process::on_exit(const boost::system::error_code& error) {
     // Only a closing handle ends the wait with an error: finish has run.
@@ -25,14 +32,11 @@ void process::on_exit(const boost::system::error_code& error) {
         wait_for_exit();
         return;
     }
-    std::uint32_t code = static_cast<std::uint32_t>(exit.code);
     if (exit.error) {
         owner->log_error("failed to read the exit status of '%s'.", name.c_str());
         owner->log_verbose("%s", platform::describe(exit.error).c_str());
-        code = unknown_status;
-    } else if (!exit.exited) {
-        code = forced ? 0 : signal_status_base + code;
     }
+    std::uint32_t code = exit_code_of(exit, forced);
     // All the child wrote is in its pipes now. What a descendant still holds
     // open is not waited for: take what is there and close. A read on its
     // way holds bytes from before the rest, so its landing comes first.
@@ -78,6 +82,10 @@ void process::finish(std::uint32_t exit_status, std::uint32_t end) {
         if (status != 0 && auto_restart && persistent)
             restart();
     }
+    // In this turn, behind all the output already relayed and behind a
+    // successor's opened: a peer that sent two requests in one write sees
+    // their ends in the order it asked, and may use the id again at once.
+    report_end();
     // Leaving the set may drop the last reference but ours.
     auto self = shared_from_this();
     owner->remove(self);

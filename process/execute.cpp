@@ -29,10 +29,10 @@ void process::handle_execute(const packet_header& header, const char* payload) {
         return;
     }
     auto created = create(owner, std::move(decision.request), {weak_from_this(), header.channel});
-    created->start();
-    // A failed start already left children: dropping created then sends
-    // failed and erases this entry again, from the destructor.
+    // The entry is there before start, so that a failed start, which sends
+    // failed at once, also frees the id at once.
     channels[header.channel] = created;
+    created->start();
 }
 
 } // namespace torvad

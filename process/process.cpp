@@ -31,8 +31,19 @@ std::shared_ptr<process> process::create(daemon* owner, execute_request what, ch
 }
 
 process::~process() {
-    // Runs after every pending read has completed, so this packet follows all
-    // of the channel's output.
+    // Only an object that never reached finish (the daemon's teardown) still
+    // owes its parent the closing packet here.
+    report_end();
+}
+
+std::string process::description() const {
+    return "'" + name + "' (pid " + std::to_string(pid) + ")";
+}
+
+void process::report_end() {
+    if (end_reported)
+        return;
+    end_reported = true;
     if (auto requester = parent.lock()) {
         requester->send_packet(channel, end_packet, status, nullptr, 0);
         requester->channels.erase(channel);

@@ -6,9 +6,9 @@
 // - Every pending operation of its own (the exit wait, the reads of its ipc
 //   pipe and relayed output, the writes) holds shared_from_this(). finish()
 //   closes all of them, so once it has run nothing keeps the object but
-//   completions already on their way; the destructor, which sends a channel's
-//   closing packet, runs behind the last of them and so behind all output
-//   that was read.
+//   completions already on their way, which carry no output: finish runs
+//   only once the output pipes are drained, and sends a channel's closing
+//   packet in that same turn.
 // Parent and channel know each other by weak_ptr alone. The daemon must
 // outlive every process.
 #pragma once
@@ -35,6 +35,10 @@ struct channel_ref {
     std::uint32_t channel = 0;
 };
 
+// The code a reaped child's end counts as: its exit status, 128 + the signal
+// of a death by signal (0 when we forced it), and 0 when it can't be read.
+std::uint32_t exit_code_of(const platform::exit_status& exit, bool forced);
+
 class process : public std::enable_shared_from_this<process> {
   public:
     // What to run and how: a top-level program's options, or a channel's
@@ -53,6 +57,8 @@ class process : public std::enable_shared_from_this<process> {
     // Asks a persistent child to stop with sigterm, ends any other by force.
     void terminate();
     void close_pipes();
+    // "'name' (pid N)", for a log line.
+    std::string description() const;
 
     daemon* const owner;
     const std::vector<std::string> command;
@@ -75,6 +81,8 @@ class process : public std::enable_shared_from_this<process> {
     void on_exit(const boost::system::error_code& error);
     void finish_after_output();
     void finish(std::uint32_t status, std::uint32_t end_packet);
+    // Sends the parent end_packet with status and frees the channel id, once.
+    void report_end();
     void restart();
 
     // relayed standard streams (process/streams.cpp)
@@ -116,6 +124,7 @@ class process : public std::enable_shared_from_this<process> {
     std::uint32_t end_packet;
     std::uint32_t status = 0;
     bool forced = false; // terminate ended the child by force: its end counts as 0
+    bool end_reported = false;
     // The child has ended and a read was on its way: its status waits here
     // until that read has landed and the pipes are drained behind it.
     bool ending = false;

@@ -15,6 +15,7 @@
 #include <thread>
 #include <vector>
 
+#include "ipc/strings.hpp"
 #include "peer/link.hpp"
 #include "peer/peer.hpp"
 #include "tests/child/child_host.hpp"
@@ -216,9 +217,12 @@ int mode_relay(const context& how) {
     return 4;
 }
 
-// Sends one execute per request, on channels 1, 2, ...: each request is its
-// flags, then its items, and "+" separates requests; "!rmcwd" instead removes
-// the working directory first. Reports every end, and stdout, per channel.
+// Sends one execute per request, on channels 1, 2, ... or on "#N" when a
+// request begins so; each request is its flags, then its items, and "+"
+// separates requests. "<text" instead sends text to the last request's stdin,
+// and "!rmcwd" removes the working directory. Everything between two
+// "!rmcwd" goes out in one write, as a peer that pipelines sends it. Reports
+// each opened, stdout and end per channel as it comes.
 int mode_execute(const context& how) {
     connection link(how.ipc_fd);
     greet(link);
@@ -229,28 +233,46 @@ int mode_execute(const context& how) {
         else
             requests.back().push_back(arg);
     }
-    std::uint32_t sent = 0;
+    std::string batch;
+    auto add = [&](std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                   const std::string& payload) {
+        auto block = encode_packet(channel, type, flags, payload.data(), payload.size());
+        batch.append(block.begin(), block.end());
+    };
+    auto flush = [&] {
+        peer::write_link(how.ipc_fd, batch.data(), batch.size());
+        batch.clear();
+    };
+    std::uint32_t next = 0, channel = 0, expected = 0;
     for (auto& request : requests) {
         std::error_code error;
-        if (request.size() == 1 && request[0] == "!rmcwd")
+        if (request.size() == 1 && request[0] == "!rmcwd") {
+            flush();
             say("rmcwd %d", fs::remove(fs::current_path(), error) ? 0 : -1);
-        else if (request.size() > 1)
-            link.execute(++sent, std::stoul(request[0]), {request.begin() + 1, request.end()});
+        } else if (request.size() == 1 && request[0].rfind('<', 0) == 0) {
+            add(channel, packet_stdin, 0, request[0].substr(1));
+        } else if (request.size() > 1) {
+            bool named = request[0][0] == '#';
+            channel = named ? std::stoul(request[0].substr(1)) : ++next;
+            auto flags = std::stoul(request[named ? 1 : 0]);
+            add(channel, packet_execute, flags,
+                join_strings({request.begin() + 1 + named, request.end()}));
+            ++expected;
+        }
     }
-    // Ends are told in channel order once all are in, whatever order they came in.
-    std::map<std::uint32_t, std::string> ends;
+    flush();
     peer::packet packet;
-    while (ends.size() < sent && link.receive(packet)) {
+    for (std::uint32_t ends = 0; ends < expected && link.receive(packet);) {
         const auto& h = packet.header;
         if (h.type == packet_sigterm)
             return 0;
         if (h.type == packet_stdout)
             say("%u stdout %s", h.channel, packet.payload.c_str());
-        else if (h.type == packet_failed || h.type == packet_closed)
-            ends[h.channel] = packet_type_name(h.type) + (" " + std::to_string(h.flags));
+        else if (h.type == packet_opened)
+            say("%u opened", h.channel);
+        else if ((h.type == packet_failed || h.type == packet_closed) && ++ends)
+            say("%u %s %u", h.channel, packet_type_name(h.type), h.flags);
     }
-    for (const auto& [channel, end] : ends)
-        say("%u %s", channel, end.c_str());
     return await_sigterm(link, true);
 }
 

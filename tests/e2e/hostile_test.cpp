@@ -31,17 +31,27 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         // refusals carry their statuses: malformed, not permitted, not found
         {requests({"8", "only", "+", "0", "", "+", "8", "someone_else", "/bin/true", "+", "0",
                    "no_such_program_xyz"}),
-         {"?user not specified", "?executable not specified", "?permission to change user denied",
-          "?executable 'no_such_program_xyz' not found.", "?child: 1 failed 22",
+         {"&user not specified", "&executable not specified", "&permission to change user denied",
+          "&executable 'no_such_program_xyz' not found.", "?child: 1 failed 22",
           "?child: 2 failed 22", "?child: 3 failed 13", "?child: 4 failed 2", "!INT", "=0"}},
         // out of descriptors: launches fail with the errno, the daemon serves on
         {requests(many_channels),
          {"?failed to create child process.", "?failed 24", "!INT", "=0"},
          {.fd_limit = 64},
          systems::linux_only},
-        // a working directory deleted under us: a relative name is not found
-        {{"-d", doomed.path, "--", child_binary, "execute", "!rmcwd", "+", "0", "./prog"},
-         {"?child: rmcwd 0", "?executable './prog' not found.", "?child: 1 failed 2", "!INT", "=0"},
+        // requests in one write: each end comes in the order asked, and frees its id at once
+        {requests({"0", "/no/such/prog", "+", "0", "/bin/true"}),
+         {"?child: 1 failed 2", "?child: 2 opened", "?child: 2 closed 0", "!INT", "=0"}},
+        {requests({"#1", "0", "/no/such/prog", "+", "#1", "0", "/bin/true"}),
+         {"?child: 1 failed 2", "?child: 1 opened", "?child: 1 closed 0", "!INT", "=0",
+          "-already exists"}},
+        {requests({"2", "/no/such/prog", "+", "<lost"}),
+         {"?child: 1 failed 2", "&channel 0x1 does not exist", "!INT", "=0"}},
+        // a working directory deleted under us: only a relative name is not found
+        {{"-d", doomed.path, "--", child_binary, "execute", "!rmcwd", "+", "0", "./prog", "+", "0",
+          "/bin/true", "+", "0", "true"},
+         {"?child: rmcwd 0", "&executable './prog' not found.", "?child: 1 failed 2",
+          "&child: 2 closed 0", "&child: 3 closed 0", "!INT", "=0"},
          {},
          systems::linux_only}, // Windows keeps a process's working directory
         // a grandchild holding the pipe does not hold back the channel's end (past the wait)

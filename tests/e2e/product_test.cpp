@@ -230,7 +230,7 @@ TEST(product, patterns_decide_requests_of_any_size) {
     std::ofstream(site.product() + "/exec.patterns") << "/bin/echo\\0x.*\n"
                                                         "/bin/true\\0(?:a|b?){5000}\n";
     run_scenario({"-d", site.product()},
-                 {"?could not be matched within", "?permission to execute denied",
-                  "?child: 1 closed 0", "?child: 2 failed 13", "!INT", "=0"},
+                 {"&could not be matched within", "&permission to execute denied",
+                  "&child: 1 closed 0", "&child: 2 failed 13", "!INT", "=0"},
                  {.env = {"PATH=" + site.root.path + "/bin"}});
 }
