@@ -41,13 +41,12 @@ os_error bind(stream& ours, owned_handle& handle) {
 
 os_error make_ipc_pipe(stream& ours, owned_handle& theirs) {
     std::string name = pipe_name("", ipc_pipe_counter++);
-    owned_handle server(CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
-                                         PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 1,
-                                         8192, 8192, 0, nullptr));
-    if (server.get() == INVALID_HANDLE_VALUE) {
-        server.release();
+    HANDLE made = CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
+                                   PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 1, 8192,
+                                   8192, 0, nullptr);
+    if (made == INVALID_HANDLE_VALUE)
         return last_error("CreateNamedPipeA");
-    }
+    owned_handle server(made);
     if (os_error error = bind(ours, server))
         return error;
     // Opening the other end connects the pipe; the child inherits this handle.
@@ -66,21 +65,21 @@ os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) 
     bool child_reads = stream_number == 0;
     std::string name = pipe_name("stdio_", relay_pipe_counter++);
     DWORD direction = child_reads ? PIPE_ACCESS_OUTBOUND : PIPE_ACCESS_INBOUND;
-    owned_handle server(CreateNamedPipeA(name.c_str(), direction | FILE_FLAG_OVERLAPPED,
-                                         PIPE_TYPE_BYTE | PIPE_READMODE_BYTE | PIPE_WAIT, 1, 65536,
-                                         65536, 0, nullptr));
-    if (server.get() == INVALID_HANDLE_VALUE) {
-        server.release();
+    HANDLE made = CreateNamedPipeA(name.c_str(), direction | FILE_FLAG_OVERLAPPED,
+                                   PIPE_TYPE_BYTE | PIPE_READMODE_BYTE | PIPE_WAIT, 1, 65536, 65536,
+                                   0, nullptr);
+    if (made == INVALID_HANDLE_VALUE)
         return last_error("CreateNamedPipeA");
-    }
+    owned_handle server(made);
     if (os_error error = bind(ours, server))
         return error;
     HANDLE client = CreateFileA(name.c_str(), child_reads ? GENERIC_READ : GENERIC_WRITE, 0,
                                 nullptr, OPEN_EXISTING, 0, nullptr);
     if (client == INVALID_HANDLE_VALUE) {
+        os_error error = last_error("CreateFileA");
         boost::system::error_code ignored;
         ours.close(ignored);
-        return last_error("CreateFileA");
+        return error;
     }
     theirs.reset(client);
     return {};
