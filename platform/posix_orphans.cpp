@@ -59,10 +59,6 @@ os_error watch_orphans(stream& watch) {
     return {};
 }
 
-void await_orphans(stream& watch, ready_handler handler) {
-    watch.async_wait(stream::wait_read, std::move(handler));
-}
-
 bool reap_orphans(stream& watch) {
     // One pending signal stands for any number of ends; the scan below finds them.
     signalfd_siginfo pending[8];

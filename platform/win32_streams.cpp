@@ -96,17 +96,6 @@ os_error attach_pipe(stream& ours, std::int64_t value) {
     return error;
 }
 
-void await_output(stream& pipe, output_buffer& buffer, ready_handler handler) {
-    buffer.reading = true;
-    pipe.async_read_some(boost::asio::buffer(buffer.bytes),
-                         [&buffer, handler = std::move(handler)](
-                             const boost::system::error_code& error, std::size_t bytes) {
-                             buffer.reading = false;
-                             buffer.held = bytes;
-                             handler(error);
-                         });
-}
-
 boost::system::error_code take_output(stream& pipe, output_buffer& buffer, const char*& data,
                                       std::size_t& size) {
     data = buffer.bytes;
