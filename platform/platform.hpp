@@ -84,12 +84,11 @@ os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs);
 // Binds a pipe that another program made and gave us by its handle value.
 os_error attach_pipe(stream& ours, std::int64_t value);
 
-// Relayed output, read as it comes. await_output completes when bytes can be
-// taken without waiting (on Windows: when one read has landed in buffer);
-// take_output then gives one read's worth at a time, would_block when there
-// is nothing more now, and another error when the stream has ended.
-using ready_handler = std::function<void(const boost::system::error_code&)>;
-void await_output(stream& pipe, output_buffer& buffer, ready_handler handler);
+// Relayed output, read as it comes. await_output (with the system's types)
+// completes when bytes can be taken without waiting (on Windows: when one read
+// has landed in buffer); take_output then gives one read's worth at a time,
+// would_block when there is nothing more now, and another error when the
+// stream has ended.
 boost::system::error_code take_output(stream& pipe, output_buffer& buffer, const char*& data,
                                       std::size_t& size);
 // True while a read armed by await_output may still land bytes: what is in the
@@ -132,9 +131,9 @@ struct launch_result {
 launch_result launch_child(const launch_request& request);
 
 // Binds the process handle of a launch to watch; on failure it stays in process.
+// await_exit (with the system's types) then completes once the child may have
+// ended (on Linux a hint: see exit_status).
 os_error watch_exit(exit_watch& watch, owned_handle& process);
-// Completes once the child may have ended (on Linux a hint: see exit_status).
-void await_exit(exit_watch& watch, ready_handler handler);
 
 struct exit_status {
     bool ended = false;  // false: still running, the wait's completion was stale
@@ -155,10 +154,10 @@ void end_now(owned_handle& process);
 
 // Makes us the reaper of our descendants whose parent has gone (the first
 // process of a PID namespace is that already) and binds watch to what tells
-// that one may have ended. watch stays closed where no orphan is ever handed
-// over (Windows). Called before any thread is started.
+// that one may have ended, which await_orphans (with the system's types)
+// waits for. watch stays closed where no orphan is ever handed over (Windows).
+// Called before any thread is started.
 os_error watch_orphans(stream& watch);
-void await_orphans(stream& watch, ready_handler handler);
 // Reaps every ended child that is not one launched above, whose status stays
 // for exit_status_of. False when such a child's end hides others: call again
 // once its status has been taken.

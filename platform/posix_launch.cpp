@@ -286,10 +286,6 @@ os_error watch_exit(exit_watch& watch, owned_handle& process) {
     return {};
 }
 
-void await_exit(exit_watch& watch, ready_handler handler) {
-    watch.async_wait(exit_watch::wait_read, std::move(handler));
-}
-
 exit_status exit_status_of(exit_watch& watch) {
     siginfo_t info{};
     if (wait_supervised(watch.native_handle(), info, WEXITED | WNOHANG) == -1)

@@ -105,10 +105,6 @@ os_error watch_orphans(stream& watch) {
     return {};
 }
 
-void await_orphans(stream& watch, ready_handler handler) {
-    watch.async_wait(stream::wait_read, std::move(handler));
-}
-
 bool reap_orphans(stream& watch) {
     std::lock_guard<std::mutex> lock(supervised_guard);
     // One pending signal stands for any number of ends; the scan below finds them.

@@ -71,10 +71,6 @@ os_error attach_pipe(stream& ours, std::int64_t value) {
     return error;
 }
 
-void await_output(stream& pipe, output_buffer&, ready_handler handler) {
-    pipe.async_wait(stream::wait_read, std::move(handler));
-}
-
 boost::system::error_code take_output(stream& pipe, output_buffer&, const char*& data,
                                       std::size_t& size) {
     boost::system::error_code error;

@@ -4,6 +4,8 @@
 #include <boost/asio/io_context.hpp>
 #include <boost/asio/posix/stream_descriptor.hpp>
 
+#include <utility>
+
 namespace torvad::platform {
 
 using native_handle = int;
@@ -24,5 +26,17 @@ using exit_watch = stream;
 // Relayed output waits for readiness and is then read into one buffer that
 // all channels share (a read is sent on at once), so a channel keeps nothing.
 struct output_buffer {};
+
+// The waits of the seam take any completion handler, as Asio's own do: one
+// kept in a std::function would cost every pending wait an allocation.
+template <class Handler> void await_output(stream& pipe, output_buffer&, Handler&& handler) {
+    pipe.async_wait(stream::wait_read, std::forward<Handler>(handler));
+}
+template <class Handler> void await_exit(exit_watch& watch, Handler&& handler) {
+    watch.async_wait(exit_watch::wait_read, std::forward<Handler>(handler));
+}
+template <class Handler> void await_orphans(stream& watch, Handler&& handler) {
+    watch.async_wait(stream::wait_read, std::forward<Handler>(handler));
+}
 
 } // namespace torvad::platform

@@ -87,10 +87,6 @@ os_error watch_exit(exit_watch& watch, owned_handle& process) {
     return {};
 }
 
-void await_exit(exit_watch& watch, ready_handler handler) {
-    watch.async_wait(std::move(handler));
-}
-
 // The wait completes only once the process has ended.
 exit_status exit_status_of(exit_watch& watch) {
     DWORD code = 0;

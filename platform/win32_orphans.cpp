@@ -8,8 +8,6 @@ os_error watch_orphans(stream&) {
     return {};
 }
 
-void await_orphans(stream&, ready_handler) {}
-
 bool reap_orphans(stream&) {
     return true;
 }

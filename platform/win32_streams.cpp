@@ -41,13 +41,12 @@ os_error bind(stream& ours, owned_handle& handle) {
 
 os_error make_ipc_pipe(stream& ours, owned_handle& theirs) {
     std::string name = pipe_name("", ipc_pipe_counter++);
-    owned_handle server(CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
-                                         PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 1,
-                                         8192, 8192, 0, nullptr));
-    if (server.get() == INVALID_HANDLE_VALUE) {
-        server.release();
+    HANDLE made = CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
+                                   PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 1, 8192,
+                                   8192, 0, nullptr);
+    if (made == INVALID_HANDLE_VALUE)
         return last_error("CreateNamedPipeA");
-    }
+    owned_handle server(made);
     if (os_error error = bind(ours, server))
         return error;
     // Opening the other end connects the pipe; the child inherits this handle.
@@ -66,21 +65,21 @@ os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) 
     bool child_reads = stream_number == 0;
     std::string name = pipe_name("stdio_", relay_pipe_counter++);
     DWORD direction = child_reads ? PIPE_ACCESS_OUTBOUND : PIPE_ACCESS_INBOUND;
-    owned_handle server(CreateNamedPipeA(name.c_str(), direction | FILE_FLAG_OVERLAPPED,
-                                         PIPE_TYPE_BYTE | PIPE_READMODE_BYTE | PIPE_WAIT, 1, 65536,
-                                         65536, 0, nullptr));
-    if (server.get() == INVALID_HANDLE_VALUE) {
-        server.release();
+    HANDLE made = CreateNamedPipeA(name.c_str(), direction | FILE_FLAG_OVERLAPPED,
+                                   PIPE_TYPE_BYTE | PIPE_READMODE_BYTE | PIPE_WAIT, 1, 65536, 65536,
+                                   0, nullptr);
+    if (made == INVALID_HANDLE_VALUE)
         return last_error("CreateNamedPipeA");
-    }
+    owned_handle server(made);
     if (os_error error = bind(ours, server))
         return error;
     HANDLE client = CreateFileA(name.c_str(), child_reads ? GENERIC_READ : GENERIC_WRITE, 0,
                                 nullptr, OPEN_EXISTING, 0, nullptr);
     if (client == INVALID_HANDLE_VALUE) {
+        os_error error = last_error("CreateFileA");
         boost::system::error_code ignored;
         ours.close(ignored);
-        return last_error("CreateFileA");
+        return error;
     }
     theirs.reset(client);
     return {};
@@ -95,17 +94,6 @@ os_error attach_pipe(stream& ours, std::int64_t value) {
     // A handle that was given to us stays open, whatever we could do with it.
     given.release();
     return error;
-}
-
-void await_output(stream& pipe, output_buffer& buffer, ready_handler handler) {
-    buffer.reading = true;
-    pipe.async_read_some(boost::asio::buffer(buffer.bytes),
-                         [&buffer, handler = std::move(handler)](
-                             const boost::system::error_code& error, std::size_t bytes) {
-                             buffer.reading = false;
-                             buffer.held = bytes;
-                             handler(error);
-                         });
 }
 
 boost::system::error_code take_output(stream& pipe, output_buffer& buffer, const char*& data,

@@ -3,7 +3,9 @@
 #pragma once
 
 #include <cstddef>
+#include <utility>
 
+#include <boost/asio/buffer.hpp>
 #include <boost/asio/io_context.hpp>
 #include <boost/asio/windows/object_handle.hpp>
 #include <boost/asio/windows/stream_handle.hpp>
@@ -31,5 +33,23 @@ struct output_buffer {
     std::size_t held = 0; // landed by the last read, not yet taken
     bool reading = false; // a read is armed and hasn't completed
 };
+
+// The waits of the seam take any completion handler, as Asio's own do: one
+// kept in a std::function would cost every pending wait an allocation.
+template <class Handler> void await_output(stream& pipe, output_buffer& buffer, Handler&& handler) {
+    buffer.reading = true;
+    pipe.async_read_some(boost::asio::buffer(buffer.bytes),
+                         [&buffer, handler = std::forward<Handler>(handler)](
+                             const boost::system::error_code& error, std::size_t bytes) mutable {
+                             buffer.reading = false;
+                             buffer.held = bytes;
+                             handler(error);
+                         });
+}
+template <class Handler> void await_exit(exit_watch& watch, Handler&& handler) {
+    watch.async_wait(std::forward<Handler>(handler));
+}
+// Nothing is ever handed over: the watch stays closed, and nothing waits.
+template <class Handler> void await_orphans(stream&, Handler&&) {}
 
 } // namespace torvad::platform

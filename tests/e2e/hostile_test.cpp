@@ -19,6 +19,8 @@ std::vector<std::string> requests(std::vector<std::string> args) {
 TEST(hostile, faults_leave_the_supervisor_serving) {
     scratch_dir dir, doomed;
     const std::string marker = dir.path + "/written", pipes = "2";
+    // Not there on either system, in a folder that is: "not found" on both.
+    const std::string missing = dir.path + "/no_such_prog";
     std::vector<std::string> many_channels;
     for (int i = 0; i < 40; ++i)
         many_channels.insert(many_channels.end(), {pipes, "/bin/sleep", "1", "+"});
@@ -40,12 +42,12 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {.fd_limit = 64},
          systems::linux_only},
         // requests in one write: each end comes in the order asked, and frees its id at once
-        {requests({"0", "/no/such/prog", "+", "0", "/bin/true"}),
+        {requests({"0", missing, "+", "0", child_binary, "exit", "0"}),
          {"?child: 1 failed 2", "?child: 2 opened", "?child: 2 closed 0", "!INT", "=0"}},
-        {requests({"#1", "0", "/no/such/prog", "+", "#1", "0", "/bin/true"}),
+        {requests({"#1", "0", missing, "+", "#1", "0", child_binary, "exit", "0"}),
          {"?child: 1 failed 2", "?child: 1 opened", "?child: 1 closed 0", "!INT", "=0",
           "-already exists"}},
-        {requests({"2", "/no/such/prog", "+", "<lost"}),
+        {requests({"2", missing, "+", "<lost"}),
          {"?child: 1 failed 2", "&channel 0x1 does not exist", "!INT", "=0"}},
         // a working directory deleted under us: only a relative name is not found
         {{"-d", doomed.path, "--", child_binary, "execute", "!rmcwd", "+", "0", "./prog", "+", "0",
