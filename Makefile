@@ -33,13 +33,14 @@ package: build
 	  DEBIAN_FRONTEND=noninteractive apt-get install -y dpkg-dev
 	cd build && cpack -G DEB
 
-# The format check, the sanitizer run and the fuzzers first, so the summary of
-# the plain run ends the output.
+# The format check, the sanitizer run, the fuzzers, the system test and the
+# Windows build's tests first, so the summary of the plain run ends the output.
 test: build
 	$(MAKE) format-check
 	$(MAKE) test-asan
 	$(MAKE) fuzz
 	$(MAKE) test-system
+	$(MAKE) test-windows
 	ctest --test-dir build --output-on-failure -j2
 
 # The package on a real systemd, booted in namespaces of its own over a
@@ -129,9 +130,12 @@ windows: windows-deps $(WIN)/build.ninja
 	cmake --build $(WIN)
 
 # One Wine prefix for the build, made once; one wineserver kept for the run,
-# so that each test program doesn't start its own.
+# so that each test program doesn't start its own. The session's own programs
+# (its service manager and devices) start first, on /dev/null: started by a
+# test they would hold that test's output open for as long as they run.
 test-windows: windows
-	test -f $(WIN)/wine/system.reg || $(WINE_ENV) wineboot --init
-	$(WINE_ENV) wineserver --persistent
+	test -f $(WIN)/wine/system.reg || $(WINE_ENV) wineboot --init </dev/null >/dev/null 2>&1
+	$(WINE_ENV) wineserver --kill 2>/dev/null; $(WINE_ENV) wineserver --persistent </dev/null >/dev/null 2>&1
+	$(WINE_ENV) wine cmd /c exit </dev/null >/dev/null 2>&1
 	$(WINE_ENV) ctest --test-dir $(WIN) --output-on-failure -j2; \
 	  status=$$?; $(WINE_ENV) wineserver --kill; exit $$status

@@ -1,6 +1,7 @@
 // Console lines and event log records: the only voice of the supervisor.
 #include "daemon/daemon.hpp"
 
+#include <algorithm>
 #include <cstdarg>
 #include <cstdio>
 
@@ -19,18 +20,19 @@ void daemon::log_line(event_type type, int colour_number, const char* format, va
     char text[log_buffer_size];
     std::vsnprintf(text, sizeof text, format, args);
     std::tm now = platform::local_time_now();
+    // The line goes out in one write, so that it stands whole beside what the
+    // children write to the same console, on a runtime without line buffering too.
     char line[log_buffer_size + line_frame_size];
-    if (colour_)
-        std::snprintf(line, sizeof line, "\x1b[3%dm%02d:%02d:%02d\x1b[36m torvad\x1b[0m %s\n",
-                      colour_number, now.tm_hour, now.tm_min, now.tm_sec, text);
-    else
-        std::snprintf(line, sizeof line, "%02d:%02d:%02d torvad %s\n", now.tm_hour, now.tm_min,
-                      now.tm_sec, text);
-    // stdout is line-buffered: one call, one write.
+    int length = colour_ ? std::snprintf(line, sizeof line,
+                                         "\x1b[3%dm%02d:%02d:%02d\x1b[36m torvad\x1b[0m %s\n",
+                                         colour_number, now.tm_hour, now.tm_min, now.tm_sec, text)
+                         : std::snprintf(line, sizeof line, "%02d:%02d:%02d torvad %s\n",
+                                         now.tm_hour, now.tm_min, now.tm_sec, text);
+    std::size_t size = std::min(static_cast<std::size_t>(std::max(length, 0)), sizeof line - 1);
     if (console_holds_ == 0)
-        std::fputs(line, stdout);
+        std::fwrite(line, 1, size, stdout);
     else
-        held_lines_ += line;
+        held_lines_.append(line, size);
     if (logging)
         platform::write_event_record(type, text);
 }
@@ -38,7 +40,7 @@ void daemon::log_line(event_type type, int colour_number, const char* format, va
 daemon::console_hold::~console_hold() {
     if (--owner_.console_holds_ != 0)
         return;
-    std::fputs(owner_.held_lines_.c_str(), stdout);
+    std::fwrite(owner_.held_lines_.data(), 1, owner_.held_lines_.size(), stdout);
     owner_.held_lines_.clear();
 }
 

@@ -10,7 +10,8 @@
 namespace torvad::platform {
 
 bool write_pid_file(const std::string& path, int pid) {
-    std::FILE* file = std::fopen(path.c_str(), "w");
+    // Binary: the line ends in a line feed alone, on Windows too.
+    std::FILE* file = std::fopen(path.c_str(), "wb");
     if (file == nullptr)
         return false;
     std::fprintf(file, "%d\n", pid);

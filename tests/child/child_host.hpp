@@ -22,5 +22,10 @@ std::vector<std::string> start_state(int ipc_fd);
 // adopted it and ends when we do. False when that can't be done (on Windows
 // nothing adopts a process).
 bool leave_orphans(int count);
+// Named for a tool of the system that the tests run (Windows: powershell,
+// schtasks, sleep), the child stands in for it and gives its exit code; -1
+// when the name is no such tool's (on Linux shell scripts and the system's
+// own tools serve).
+int stand_in_for_tool(const char* self);
 
 } // namespace child_host

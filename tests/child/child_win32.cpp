@@ -1,15 +1,29 @@
 #include <windows.h>
 
+#include <cctype>
+#include <cstdlib>
 #include <fcntl.h>
+#include <filesystem>
+#include <fstream>
 #include <io.h>
+#include <sstream>
 
 #include "tests/child/child_host.hpp"
 
 namespace child_host {
 
+namespace {
+// Ctrl-C at the console reaches every program on it; a peer ends by its
+// sigterm packet, as it does when torvad runs as a service.
+BOOL WINAPI ignore_interrupt(DWORD event) {
+    return event == CTRL_C_EVENT || event == CTRL_BREAK_EVENT;
+}
+} // namespace
+
 void prepare_streams() {
     for (int stream : {0, 1, 2})
         _setmode(stream, _O_BINARY);
+    SetConsoleCtrlHandler(ignore_interrupt, TRUE);
 }
 
 int own_pid() {
@@ -49,6 +63,46 @@ std::vector<std::string> start_state(int) {
 
 bool leave_orphans(int) {
     return false;
+}
+
+namespace {
+
+// What follows the program on the command line, exactly as the line holds it.
+std::string command_line_arguments() {
+    std::string line = GetCommandLineA();
+    std::size_t end = line[0] == '"' ? line.find('"', 1) + 1 : line.find(' ');
+    return end >= line.size() ? std::string() : line.substr(end + 1);
+}
+
+} // namespace
+
+// sleep waits its seconds. schtasks and powershell append their arguments as
+// a line to <tool>.log in the working directory; powershell then prints the
+// script behind -file, and fails when there is none.
+int stand_in_for_tool(const char* self) {
+    std::string tool = std::filesystem::path(self).stem().string();
+    for (auto& c : tool)
+        c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    if (tool == "sleep" && __argc > 1) {
+        Sleep(static_cast<DWORD>(std::atoi(__argv[1])) * 1000);
+        return 0;
+    }
+    if (tool != "schtasks" && tool != "powershell")
+        return -1;
+    std::ofstream(tool + ".log", std::ios::app | std::ios::binary)
+        << command_line_arguments() << "\n";
+    if (tool == "schtasks")
+        return 0;
+    for (int i = 1; i + 1 < __argc; ++i) {
+        if (std::string(__argv[i]) != "-file")
+            continue;
+        std::ifstream script(__argv[i + 1], std::ios::binary);
+        std::stringstream text;
+        text << script.rdbuf();
+        std::string content = text.str();
+        return script && write_stream(1, content.data(), content.size()) ? 0 : 1;
+    }
+    return 1;
 }
 
 } // namespace child_host

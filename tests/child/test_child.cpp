@@ -1,6 +1,7 @@
 // The child program of the end-to-end tests: one mode per behaviour a
 // supervised program can show. It reports on stdout in lines "child: ...".
 //   test_child <mode> [args...] [ipc fd, appended by torvad]
+#include <algorithm>
 #include <chrono>
 #include <csignal>
 #include <cstdarg>
@@ -30,10 +31,13 @@ void say(const char* format, ...) __attribute__((format(printf, 1, 2)));
 void say(const char* format, ...) {
     va_list args;
     va_start(args, format);
-    std::printf("child: ");
-    std::vprintf(format, args);
-    std::printf("\n");
+    // One write for the line, so it stands whole beside the supervisor's.
+    char line[4096] = "child: ";
+    int length = std::vsnprintf(line + 7, sizeof line - 8, format, args);
+    length = 7 + std::min(length, static_cast<int>(sizeof line - 9));
+    line[length++] = '\n';
     std::fflush(stdout);
+    child_host::write_stream(1, line, static_cast<std::size_t>(length));
     va_end(args);
 }
 
@@ -85,7 +89,8 @@ int serve(const context& how, bool obey_sigterm) {
 // A peer whose report goes to the file FILE, for a run with no console to
 // write to (a service): its version, then how it ended.
 int mode_record(const context& how) {
-    std::ofstream report(how.args.empty() ? "record.log" : how.args[0], std::ios::app);
+    std::ofstream report(how.args.empty() ? "record.log" : how.args[0],
+                         std::ios::app | std::ios::binary);
     connection link(how.ipc_fd);
     peer::version_info version;
     if (!peer::read_version(link, version))
@@ -381,8 +386,10 @@ const mode modes[] = {
 } // namespace
 
 // Named "core" ("core.exe" on Windows), it stands in for the product's server
-// program: it answers -h with its version on stderr and otherwise reports as
-// the fds mode does.
+// program: it answers -h with its version on stderr (a file "silent" in its
+// working directory keeps the version back) and otherwise reports as the fds
+// mode does, or records as the record mode does to a file "core.log" that is
+// there, for a run with no console.
 bool is_core(const char* self) {
     std::string name = fs::path(self).filename().string();
     return name == "core" || name == "core.exe";
@@ -392,7 +399,12 @@ int main(int argc, char** argv) {
     child_host::prepare_streams();
     context how{argv[0], {}, peer::ipc_fd_from_arguments(argc, argv)};
     if (is_core(argv[0]) && argc > 1 && std::strcmp(argv[1], "-h") == 0)
-        return std::fputs("test_child version 1\n", stderr) < 0;
+        return std::fputs(fs::exists("silent") ? "usage: core\n" : "test_child version 1\n",
+                          stderr) < 0;
+    if (int code = child_host::stand_in_for_tool(argv[0]); code >= 0)
+        return code;
+    if (is_core(argv[0]) && fs::exists("core.log"))
+        return mode_record({argv[0], {"core.log"}, how.ipc_fd});
     if (is_core(argv[0]))
         return mode_fds(how);
     for (int i = 2; i < (how.ipc_fd >= 0 ? argc - 1 : argc); ++i)

@@ -2,6 +2,8 @@
 // stops, launch failures, account switch and descriptor hygiene.
 #include <gtest/gtest.h>
 
+#include <filesystem>
+
 #include "tests/e2e/harness.hpp"
 
 using namespace e2e;
@@ -118,13 +120,19 @@ TEST(children, a_requester_s_end_closes_the_pipes_of_its_channels) {
 
 // A channel outlives its requester; at the stop it has no living parent, so
 // it is ended by force and that end counts as 0. The requester ignores
-// sigterm, so the run lasts until that end is seen.
+// sigterm, so the run lasts until that end is seen. Windows has no sleep of
+// its own: a copy of the test child stands in for it there.
 TEST(children, an_orphaned_channel_is_ended_by_force_at_the_stop) {
-    if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "lists descriptors and runs sleep";
     scratch_dir dir;
+    bool on_linux = holds_here(systems::linux_only);
+    options how;
+    if (!on_linux) {
+        std::filesystem::copy(std::string(child_binary) + ".exe", dir.path + "/sleep.exe");
+        how.env = {"PATH=" + dir.path};
+    }
     run_scenario(child({"spawn-once", dir.path + "/spawned"}),
                  {"?child: spawned", "?starting 'test_child' again.", "#ready pid",
-                  "&child: fds clean", "!INT", "?'sleep' exited with 0x0.", "kill 9", "=0",
-                  "-leaked"});
+                  on_linux ? "&child: fds clean" : "&child: user=", "!INT",
+                  "?'sleep' exited with 0x0.", "kill 9", "=0", "-leaked"},
+                 how);
 }

@@ -85,7 +85,7 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
         else if (step == "Z")
             EXPECT_EQ(zombie_children(run.pid()), 0);
         else if (step == "z")
-            EXPECT_TRUE(no_zombie_within(run.pid(), 10000)) << run.output();
+            EXPECT_TRUE(no_zombie_within(run.pid(), event_wait_ms)) << run.output();
         else if (step[0] == '&')
             EXPECT_TRUE(run.wait_anywhere(text)) << "waited for: " << text << "\n" << run.output();
         else if (step[0] == '+')

@@ -13,6 +13,14 @@ namespace e2e {
 
 extern const char* const torvad_binary;
 extern const char* const child_binary;
+// The bound of a wait for an event: 10 s, and 30 s under Wine, which moves
+// every byte of a pipe through its server and runs the tests some times
+// slower.
+extern const int event_wait_ms;
+// How long the service dispatcher may take to refuse a program that the
+// service manager didn't start: at once on Linux, 10 s under Wine (see
+// harness_win32.cpp).
+extern const int dispatcher_refusal_ms;
 
 // Where a row of a table holds.
 enum class systems { both, linux_only, windows_only };
@@ -40,13 +48,13 @@ class daemon_run {
     daemon_run(const daemon_run&) = delete;
 
     // Reads until text appears behind the cursor; moves the cursor behind it.
-    bool wait_for(const std::string& text, int timeout_ms = 10000);
+    bool wait_for(const std::string& text, int timeout_ms = event_wait_ms);
     // Reads until text appears anywhere; the cursor stays where it was.
-    bool wait_anywhere(const std::string& text, int timeout_ms = 10000);
+    bool wait_anywhere(const std::string& text, int timeout_ms = event_wait_ms);
     // The value behind "key=" in the next output that holds it, e.g. a pid.
-    std::string wait_value(const std::string& key, int timeout_ms = 10000);
+    std::string wait_value(const std::string& key, int timeout_ms = event_wait_ms);
     // The exit code, or -1 when it didn't end in time (it is killed then).
-    int wait_exit(int timeout_ms = 10000);
+    int wait_exit(int timeout_ms = event_wait_ms);
     // A stop request: SIGINT or SIGTERM on Linux, Ctrl-C at its console on Windows.
     void signal(int signal_number);
     // Ctrl-C as a terminal gives it: to torvad and whatever shares its terminal.

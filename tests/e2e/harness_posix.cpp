@@ -90,6 +90,9 @@ void open_output(bool terminal, int& ours, int& theirs) {
 
 } // namespace
 
+const int event_wait_ms = 10000;
+const int dispatcher_refusal_ms = 10000;
+
 bool holds_here(systems where) {
     return where != systems::windows_only;
 }

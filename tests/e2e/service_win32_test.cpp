@@ -6,6 +6,8 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <filesystem>
+#include <fstream>
 #include <thread>
 
 #include "tests/e2e/harness.hpp"
@@ -14,8 +16,9 @@ using namespace e2e;
 
 namespace {
 
-// Runs a tool of the system to its end; its output, both streams.
-std::string run_tool(std::string command) {
+// Runs a tool of the system to its end; its output, both streams, and its
+// exit code in exit_code.
+std::string run_tool(std::string command, DWORD* exit_code = nullptr) {
     SECURITY_ATTRIBUTES inheritable{sizeof inheritable, nullptr, TRUE};
     HANDLE ours = nullptr, theirs = nullptr;
     if (!CreatePipe(&ours, &theirs, &inheritable, 0))
@@ -37,6 +40,8 @@ std::string run_tool(std::string command) {
     CloseHandle(ours);
     if (ran) {
         WaitForSingleObject(started.hProcess, INFINITE);
+        if (exit_code != nullptr)
+            GetExitCodeProcess(started.hProcess, exit_code);
         CloseHandle(started.hProcess);
         CloseHandle(started.hThread);
     }
@@ -55,30 +60,46 @@ bool becomes_true(const std::function<bool()>& condition) {
 
 } // namespace
 
+// An explicit command, and the product found in the working directory (a copy
+// of the test child as core.exe, which records to core.log when that is there):
+// either way the child's record shows version first and the sigterm last.
 TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
-    scratch_dir dir;
-    std::string name = "torvad_test_" + std::to_string(GetCurrentProcessId());
-    std::string record = dir.path + "/child.log", pid_file = dir.path + "/pid";
-    std::string command = std::string("\\\"") + torvad_binary + "\\\" -p " + pid_file + " -d " +
-                          dir.path + " -- \\\"" + child_binary + "\\\" record " + record;
-    std::string created = run_tool("sc create " + name + " binpath= \"" + command + "\"");
-    ASSERT_NE(created.find("SUCCESS"), std::string::npos) << created;
+    for (bool product : {false, true}) {
+        SCOPED_TRACE(product ? "core.exe" : "explicit command");
+        scratch_dir dir;
+        std::string name = "torvad_test_" + std::to_string(GetCurrentProcessId());
+        std::string record = dir.path + (product ? "/core.log" : "/child.log");
+        std::string pid_file = dir.path + "/pid";
+        std::string command =
+            std::string("\\\"") + torvad_binary + "\\\" -p " + pid_file + " -d " + dir.path;
+        if (product) {
+            std::filesystem::copy(std::string(child_binary) + ".exe", dir.path + "/core.exe");
+            std::ofstream{record};
+        } else {
+            command += " -- \\\"" + std::string(child_binary) + "\\\" record " + record;
+        }
+        // Wine's sc tells a success by its exit code alone.
+        DWORD created = 1;
+        std::string said =
+            run_tool("sc create " + name + " binpath= \"" + command + "\"", &created);
+        ASSERT_EQ(created, 0u) << said;
 
-    run_tool("sc start " + name);
-    auto state_is = [&name](const char* state) {
-        return [&name, state] {
-            return run_tool("sc query " + name).find(state) != std::string::npos;
+        run_tool("sc start " + name);
+        auto state_is = [&name](const char* state) {
+            return [&name, state] {
+                return run_tool("sc query " + name).find(state) != std::string::npos;
+            };
         };
-    };
-    EXPECT_TRUE(becomes_true(state_is("RUNNING")));
-    EXPECT_TRUE(becomes_true([&] { return read_file(record).starts_with("version 1.1.21.0"); }))
-        << read_file(record);
-    EXPECT_TRUE(file_exists(pid_file));
+        EXPECT_TRUE(becomes_true(state_is("RUNNING")));
+        EXPECT_TRUE(becomes_true([&] { return read_file(record).starts_with("version 1.1.21.0"); }))
+            << read_file(record);
+        EXPECT_TRUE(file_exists(pid_file));
 
-    run_tool("sc stop " + name);
-    EXPECT_TRUE(becomes_true(state_is("STOPPED")));
-    EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("sigterm\n"); }))
-        << read_file(record);
-    EXPECT_TRUE(becomes_true([&] { return !file_exists(pid_file); }));
-    run_tool("sc delete " + name);
+        run_tool("sc stop " + name);
+        EXPECT_TRUE(becomes_true(state_is("STOPPED")));
+        EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("sigterm\n"); }))
+            << read_file(record);
+        EXPECT_TRUE(becomes_true([&] { return !file_exists(pid_file); }));
+        run_tool("sc delete " + name);
+    }
 }
