@@ -13,32 +13,17 @@
 #include <string>
 #include <vector>
 
+#include "tests/e2e/quote_win32.hpp"
+
 namespace {
+
+using e2e::quote;
 
 void say(const std::string& line) {
     DWORD put = 0;
     std::string text = "console-host " + line + "\n";
     WriteFile(GetStdHandle(STD_OUTPUT_HANDLE), text.data(), static_cast<DWORD>(text.size()), &put,
               nullptr);
-}
-
-// The command line that gives the program exactly these arguments back.
-std::string quote(const std::string& argument) {
-    if (!argument.empty() && argument.find_first_of(" \t\"") == std::string::npos)
-        return argument;
-    std::string quoted = "\"";
-    std::size_t backslashes = 0;
-    for (char c : argument) {
-        if (c == '\\') {
-            ++backslashes;
-            continue;
-        }
-        quoted.append(c == '"' ? 2 * backslashes + 1 : backslashes, '\\');
-        backslashes = 0;
-        quoted += c;
-    }
-    quoted.append(2 * backslashes, '\\');
-    return quoted + "\"";
 }
 
 // Ctrl-C is for the program; we only wait for it. A handler, unlike ignoring

@@ -24,31 +24,13 @@
 #include <thread>
 
 #include "tests/e2e/harness.hpp"
+#include "tests/e2e/quote_win32.hpp"
 
 namespace e2e {
 
 namespace {
 
 const char* const console_host_binary = CONSOLE_HOST_BINARY;
-
-// The command line that gives the program exactly these arguments back.
-std::string quote(const std::string& argument) {
-    if (!argument.empty() && argument.find_first_of(" \t\"") == std::string::npos)
-        return argument;
-    std::string quoted = "\"";
-    std::size_t backslashes = 0;
-    for (char c : argument) {
-        if (c == '\\') {
-            ++backslashes;
-            continue;
-        }
-        quoted.append(c == '"' ? 2 * backslashes + 1 : backslashes, '\\');
-        backslashes = 0;
-        quoted += c;
-    }
-    quoted.append(2 * backslashes, '\\');
-    return quoted + "\"";
-}
 
 std::string shell_word(const std::string& text) {
     std::string word = "'";
