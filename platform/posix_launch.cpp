@@ -277,15 +277,6 @@ launch_result launch_child(const launch_request& request) {
     return clone_child(plan);
 }
 
-os_error watch_exit(exit_watch& watch, owned_handle& process) {
-    boost::system::error_code failure;
-    watch.assign(process.get(), failure);
-    if (failure)
-        return {failure.value(), "assign"};
-    process.release();
-    return {};
-}
-
 exit_status exit_status_of(exit_watch& watch) {
     siginfo_t info{};
     if (wait_supervised(watch.native_handle(), info, WEXITED | WNOHANG) == -1)

@@ -78,15 +78,6 @@ launch_result launch_child(const launch_request& request) {
     return result;
 }
 
-os_error watch_exit(exit_watch& watch, owned_handle& process) {
-    boost::system::error_code failure;
-    watch.assign(process.get(), failure);
-    if (failure)
-        return {failure.value(), "assign"};
-    process.release();
-    return {};
-}
-
 // The wait completes only once the process has ended.
 exit_status exit_status_of(exit_watch& watch) {
     DWORD code = 0;
