@@ -86,9 +86,17 @@ inside sh -c 'mkdir -p /etc/systemd/system.conf.d &&
     printf "[Manager]\nDefaultTimeoutStartSec=4s\n" > /etc/systemd/system.conf.d/start.conf' &&
     inside systemctl daemon-reexec
 
-check "the package installs" inside dpkg -i "$deb"
-inside sh -c "cp '$demo_core' /opt/torvad/core && cp -r '$demo/exec.patterns' '$demo/scripts' /opt/torvad/ &&
-    cp '$demo/bin/powershell' /usr/local/bin/"
+# The checkout may lie where the guest has a tmpfs of its own (/tmp, /run),
+# so what it needs goes in through a pipe.
+stage=/var/tmp/torvad-system-test
+inside mkdir -p "$stage"
+tar -cf - -C "$(dirname "$deb")" "$(basename "$deb")" -C "$(dirname "$demo_core")" \
+    "$(basename "$demo_core")" -C "$demo" exec.patterns scripts bin/powershell |
+    inside tar -xf - -C "$stage"
+check "the package installs" inside dpkg -i "$stage/$(basename "$deb")"
+inside sh -c "cp '$stage/$(basename "$demo_core")' /opt/torvad/core &&
+    cp -r '$stage/exec.patterns' '$stage/scripts' /opt/torvad/ &&
+    cp '$stage/bin/powershell' /usr/local/bin/"
 check "enable --now" inside systemctl enable --now torvad
 check "active once ready" is torvad ActiveState active
 check "the status names the running child" within 10 is torvad StatusText "running, 1 child"
