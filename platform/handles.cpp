@@ -6,12 +6,7 @@ namespace torvad::platform {
 // Asio's object for a pidfd and for a process handle take a handle the same
 // way: the watch owns it from here on.
 os_error watch_exit(exit_watch& watch, owned_handle& process) {
-    boost::system::error_code failure;
-    watch.assign(process.get(), failure);
-    if (failure)
-        return {failure.value(), "assign"};
-    process.release();
-    return {};
+    return adopt_handle(watch, process);
 }
 
 } // namespace torvad::platform

@@ -135,6 +135,17 @@ launch_result launch_child(const launch_request& request);
 // ended (on Linux a hint: see exit_status).
 os_error watch_exit(exit_watch& watch, owned_handle& process);
 
+// Hands handle to an Asio object of either system, which owns it from then
+// on; on failure it stays in handle.
+template <class asio_object> os_error adopt_handle(asio_object& into, owned_handle& handle) {
+    boost::system::error_code failure;
+    into.assign(handle.get(), failure);
+    if (failure)
+        return {failure.value(), "assign"};
+    handle.release();
+    return {};
+}
+
 struct exit_status {
     bool ended = false;  // false: still running, the wait's completion was stale
     bool exited = false; // false: killed by a signal

@@ -21,11 +21,9 @@ char shared_output[output_read_size];
 
 // Takes the descriptor into ours, non-blocking; on failure it stays in handle.
 os_error bind(stream& ours, owned_handle& handle) {
+    if (os_error error = adopt_handle(ours, handle))
+        return error;
     boost::system::error_code failure;
-    ours.assign(handle.get(), failure);
-    if (failure)
-        return {failure.value(), "assign"};
-    handle.release();
     ours.non_blocking(true, failure);
     return failure ? os_error{failure.value(), "fcntl"} : os_error{};
 }

@@ -29,12 +29,7 @@ os_error last_error(const char* call) {
 
 // Binds handle to ours; on failure it stays in handle.
 os_error bind(stream& ours, owned_handle& handle) {
-    boost::system::error_code failure;
-    ours.assign(handle.get(), failure);
-    if (failure)
-        return {failure.value(), "assign"};
-    handle.release();
-    return {};
+    return adopt_handle(ours, handle);
 }
 
 } // namespace
