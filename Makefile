@@ -49,7 +49,7 @@ test: build
 test-system: package
 	@dpkg -s systemd util-linux >/dev/null 2>&1 || { apt-get update && \
 	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux; }
-	tests/system/run.sh build/torvad_$$(sed -n 's/^set(CPACK_PACKAGE_VERSION \(.*\))/\1/p' CMakeLists.txt)_amd64.deb build/demo_core
+	tests/system/run.sh build/torvad_$$(sed -n 's/^project(torvad VERSION \([^ ]*\).*/\1/p' CMakeLists.txt)_amd64.deb build/demo_core
 
 build-asan/build.ninja:
 	cmake -S . -B build-asan -G Ninja -DCMAKE_BUILD_TYPE=Debug -DTORVAD_SANITIZE=ON

@@ -1,5 +1,6 @@
 // The daemon's life: configuration, the start of its children, the signal
-// that stops them, and the end of the run when no persistent child is left.
+// that stops them, the end of the run when no persistent child is left, and
+// the shutdown after it.
 #include "daemon/daemon.hpp"
 
 #include <csignal>
@@ -11,20 +12,22 @@
 
 namespace torvad {
 
-bool verbose = false;
-bool logging = false;
-bool background = false;
-bool auto_restart = true;
-const char* const daemon_version = "1.1.21.0";
-
-daemon::daemon()
-    : colour_(platform::console_takes_colour()), signals_(*this, SIGINT),
-      orphan_watch_(get_executor()) {}
+daemon::daemon(const settings& chosen)
+    : settings_(chosen), colour_(platform::console_takes_colour()), signals_(loop_, SIGINT),
+      orphan_watch_(loop_) {
+    facts_.verbose = settings_.verbose;
+    facts_.background = settings_.background;
+    set_colour(colour_);
+}
 
 daemon::~daemon() {
-    // Children go first, while the loop's services still exist for the
-    // descriptors they close; the base then drops whatever handlers remain.
-    children_.clear();
+    shut_down();
+}
+
+void daemon::set_colour(bool colour) {
+    colour_ = colour;
+    // A trace line in the event log stays plain.
+    facts_.trace_colour = colour && !settings_.logging;
 }
 
 void daemon::configure(const std::string& name, const char* patterns_path) {
@@ -63,6 +66,7 @@ void daemon::add_stop_signal(int signal_number) {
 }
 
 void daemon::arm_signal_wait() {
+    // The daemon outlives every handler of its loop (see shut_down).
     signals_.async_wait([this](const boost::system::error_code& error, int signal_number) {
         on_signal(error, signal_number);
     });
@@ -75,22 +79,22 @@ void daemon::start() {
     for (const auto& child : starting)
         all_started = child->start() && all_started;
     if (all_started)
-        log_info("successfully started torvad version %s", daemon_version);
+        log_info("successfully started torvad version %s", torvad_version);
     else if (any_persistent())
-        log_warning("started torvad version %s", daemon_version);
+        log_warning("started torvad version %s", torvad_version);
     else
-        log_error("failed to start torvad version %s", daemon_version);
+        log_error("failed to start torvad version %s", torvad_version);
 }
 
-void daemon::terminate_children() {
-    log_info("stopping torvad version %s...", daemon_version);
+void daemon::stop_children() {
+    log_info("stopping torvad version %s...", torvad_version);
     // terminate never changes the set (an exit is seen later, on the loop),
     // but a copy keeps that a local fact rather than a promise of process.
     auto stopping = children_;
     for (const auto& child : stopping)
         if (child->parent.expired() || child->persistent)
             child->terminate();
-    auto_restart = false;
+    settings_.auto_restart = false;
     // Nothing escalates after sigterm, so a stop asked for again can only
     // say whom it is waiting for.
     if (stop_requested_)
@@ -107,25 +111,13 @@ void daemon::name_awaited_children() {
         log_warning("still waiting for %s to end after sigterm.", awaited.c_str());
 }
 
-void daemon::stop() {
-    terminate_children();
-}
-
 void daemon::on_signal(const boost::system::error_code& error, int /*signal_number*/) {
     if (error)
         return;
-    terminate_children();
+    stop_children();
     arm_signal_wait();
     if (!any_persistent())
-        io_context::stop();
-}
-
-bool daemon::any_persistent() const {
-    return persistent_children_ != 0;
-}
-
-std::size_t daemon::persistent_count() const {
-    return persistent_children_;
+        stop_loop();
 }
 
 // One report per turn of the loop at most: a restart adds the successor and
@@ -134,24 +126,49 @@ void daemon::persistent_children_changed() {
     if (children_report_posted_)
         return;
     children_report_posted_ = true;
-    boost::asio::post(*this, [this] {
+    boost::asio::post(loop_, [this] {
         children_report_posted_ = false;
         platform::report_service_children(persistent_count());
     });
 }
 
 void daemon::run() {
+    // A loop stopped before (by a stop control) runs again from here.
+    loop_.restart();
     // Handlers report failures by result, not by exception; what can still
     // come out of one is an allocation that failed. The loop logs it and goes
     // on, so that one child's bad moment doesn't end the others' supervision.
     while (any_persistent()) {
         try {
-            io_context::run();
+            loop_.run();
             return;
         } catch (const std::exception& failure) {
             log_error("internal error: %s", failure.what());
         }
     }
+}
+
+void daemon::stop_loop() {
+    loop_.stop();
+}
+
+void daemon::shut_down() {
+    if (shut_down_)
+        return;
+    shut_down_ = true;
+    boost::system::error_code ignored;
+    signals_.cancel(ignored);
+    orphan_watch_.close(ignored);
+    for (const auto& child : children_)
+        child->close_all();
+    // Every pending handler now completes as aborted and lets go of its
+    // process; nothing is sent or logged from here on.
+    loop_.restart();
+    try {
+        loop_.run();
+    } catch (const std::exception&) {
+    }
+    children_.clear();
 }
 
 void daemon::adopt(std::shared_ptr<process> child) {
@@ -171,13 +188,25 @@ void daemon::remove(const std::shared_ptr<process>& child) {
         persistent_children_changed();
     }
     if (!any_persistent())
-        io_context::stop();
+        stop_loop();
 }
 
-// The start state is made before the daemon's own descriptors exist, so that
-// none of them can take the number of a standard stream a parent left closed.
-static const bool own_process_prepared = (platform::prepare_own_process(), true);
-
-daemon the_daemon;
+void daemon::child_ended(const process& child, std::uint32_t status) {
+    bool again = status != 0 && settings_.auto_restart && child.persistent;
+    {
+        // Both lines in one console write, and both ahead of the launch.
+        console_hold lines(*this);
+        if (status == 0)
+            log_info("'%s' exited with 0x%x.", child.name().c_str(), status);
+        else
+            log_warning("'%s' exited with 0x%x.", child.name().c_str(), status);
+        if (again)
+            log_info("starting '%s' again.", child.name().c_str());
+    }
+    // The successor is in the set before its predecessor leaves, so the run
+    // never looks empty across a restart.
+    if (again)
+        process::create(*this, child.request(), child.place())->start();
+}
 
 } // namespace torvad

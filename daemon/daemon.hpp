@@ -1,7 +1,8 @@
-// The one supervisor: the event loop, the owner of every process (through its
-// set of children), the execution patterns and the sink of all log lines. It
-// is a global that outlives every process; a process refers to it by plain
-// pointer.
+// The one supervisor: the owner of every process (through its set of
+// children), its event loop, the execution patterns and the sink of all log
+// lines. main owns it; it must outlive every process, which it guarantees by
+// shutting down (closing every handle and running the loop dry) before any
+// of its members goes.
 #pragma once
 
 #include <memory>
@@ -13,34 +14,29 @@
 
 #include "ipc/patterns.hpp"
 #include "platform/platform.hpp"
+#include "process/owner.hpp"
 
 namespace torvad {
 
 class process;
 
-extern bool verbose;      // -v: log_verbose lines and the packet trace
-extern bool logging;      // -l: every line also goes to the event log
-extern bool background;   // the service path: stdout is not a terminal, or -b
-extern bool auto_restart; // cleared by -o and by any stop; never set again
-extern const char* const daemon_version;
+// How this run was asked to behave, from the command line and the console.
+struct settings {
+    bool verbose = false;     // -v: log_verbose lines and the packet trace
+    bool logging = false;     // -l: every line also goes to the event log
+    bool background = false;  // the service path: stdout is not a terminal, or -b
+    bool auto_restart = true; // cleared by -o; any stop clears it for good
+};
 
-using event_type = platform::event_type;
-
-class daemon : public boost::asio::io_context {
+class daemon final : public process_owner {
   public:
-    daemon();
+    explicit daemon(const settings& chosen);
     ~daemon();
     daemon(const daemon&) = delete;
     daemon& operator=(const daemon&) = delete;
 
-    // The log front ends (daemon/log.cpp): one console line each, and one
-    // event log record with -l. log_verbose formats nothing without -v.
-    void log_error(const char* format, ...) __attribute__((format(printf, 2, 3)));
-    void log_warning(const char* format, ...) __attribute__((format(printf, 2, 3)));
-    void log_info(const char* format, ...) __attribute__((format(printf, 2, 3)));
-    void log_verbose(const char* format, ...) __attribute__((format(printf, 2, 3)));
     bool colour() const { return colour_; }
-    void set_colour(bool colour) { colour_ = colour; }
+    void set_colour(bool colour);
     // Console lines logged while a hold lives wait, and go out in one write
     // when the last hold ends: a child's exit line and its restart line, say.
     class console_hold {
@@ -61,31 +57,34 @@ class daemon : public boost::asio::io_context {
     void add_stop_signal(int signal_number);
     // Starts every child made so far and logs how that went.
     void start();
-    // The stop of the supervised: log, terminate the children, no more
-    // restarts. It hides io_context::stop on purpose: the loop itself is
-    // stopped by io_context::stop, named in full wherever it is meant.
-    void stop();
-    // Runs the loop while a persistent child is left; hides io_context::run
-    // in the same way.
+    // The stop of the supervised: log, terminate the children, no more restarts.
+    void stop_children();
+    // Runs the loop while a persistent child is left (again after stop_loop).
     void run();
-    bool any_persistent() const;
+    // Makes run() return; the one way the loop is stopped, from any thread.
+    void stop_loop();
+    // Closes everything still open and runs the loop until no handler is
+    // left, so nothing outlives the daemon's members. Called once, at the end.
+    void shut_down();
+    bool any_persistent() const { return persistent_children_ != 0; }
+    std::size_t persistent_count() const { return persistent_children_; }
     // Reaps, from now on, the orphaned descendants the kernel hands us, never
     // a child we supervise. Called before any thread is started. (daemon/orphans.cpp)
     void take_orphans();
-    std::size_t persistent_count() const;
-
-    // What a process needs of its owner.
-    void adopt(std::shared_ptr<process> child);
-    void remove(const std::shared_ptr<process>& child);
-    const pattern_lists& patterns() const { return patterns_; }
-    const std::string& program_name() const { return program_name_; }
-    void set_program_name(std::string name) { program_name_ = std::move(name); }
+    void set_program_name(std::string name) { facts_.program_name = std::move(name); }
     const std::string& service_name() const { return service_name_; }
 
+    // What a process needs of its owner.
+    boost::asio::io_context& loop() override { return loop_; }
+    void adopt(std::shared_ptr<process> child) override;
+    void remove(const std::shared_ptr<process>& child) override;
+    void child_ended(const process& child, std::uint32_t status) override;
+    const pattern_lists& patterns() const override { return patterns_; }
+    const run_facts& facts() const override { return facts_; }
+    void write_log(platform::event_type type, const char* text) override;
+
   private:
-    void log_line(event_type type, int colour_number, const char* format, va_list args);
     void load_patterns(const char* path);
-    void terminate_children();
     void name_awaited_children();
     void arm_signal_wait();
     void on_signal(const boost::system::error_code& error, int signal_number);
@@ -93,11 +92,15 @@ class daemon : public boost::asio::io_context {
     void wait_for_orphans();
     void reap_orphans();
 
+    // The loop goes first among the members and so is destroyed last: every
+    // object below holds handles registered with it.
+    boost::asio::io_context loop_;
+    settings settings_;
+    run_facts facts_;
     bool colour_;
     int console_holds_ = 0;
     std::string held_lines_;
     std::string service_name_;
-    std::string program_name_;
     std::unordered_set<std::shared_ptr<process>> children_;
     std::size_t persistent_children_ = 0; // kept with children_, so never counted
     boost::asio::signal_set signals_;
@@ -105,9 +108,7 @@ class daemon : public boost::asio::io_context {
     pattern_lists patterns_;
     bool children_report_posted_ = false;
     bool stop_requested_ = false;
+    bool shut_down_ = false;
 };
-
-// The supervisor of this program, built before main and gone after it.
-extern daemon the_daemon;
 
 } // namespace torvad

@@ -2,7 +2,6 @@
 #include "daemon/daemon.hpp"
 
 #include <algorithm>
-#include <cstdarg>
 #include <cstdio>
 
 namespace torvad {
@@ -11,21 +10,28 @@ namespace {
 constexpr std::size_t log_buffer_size = 4096;
 // The time, the name and the colours around the text.
 constexpr std::size_t line_frame_size = 64;
-// Colour numbers of the console line: the second digit of an ANSI foreground.
-enum level_colour : int { colour_red = 1, colour_green = 2, colour_yellow = 3 };
+
+// The second digit of an ANSI foreground: red, yellow, green.
+int colour_of(platform::event_type type) {
+    switch (type) {
+    case platform::event_type::error:
+        return 1;
+    case platform::event_type::warning:
+        return 3;
+    default:
+        return 2;
+    }
+}
 } // namespace
 
-void daemon::log_line(event_type type, int colour_number, const char* format, va_list args) {
-    // A longer text is cut to 4095 characters without a word about it.
-    char text[log_buffer_size];
-    std::vsnprintf(text, sizeof text, format, args);
+void daemon::write_log(platform::event_type type, const char* text) {
     std::tm now = platform::local_time_now();
     // The line goes out in one write, so that it stands whole beside what the
     // children write to the same console, on a runtime without line buffering too.
     char line[log_buffer_size + line_frame_size];
     int length = colour_ ? std::snprintf(line, sizeof line,
                                          "\x1b[3%dm%02d:%02d:%02d\x1b[36m torvad\x1b[0m %s\n",
-                                         colour_number, now.tm_hour, now.tm_min, now.tm_sec, text)
+                                         colour_of(type), now.tm_hour, now.tm_min, now.tm_sec, text)
                          : std::snprintf(line, sizeof line, "%02d:%02d:%02d torvad %s\n",
                                          now.tm_hour, now.tm_min, now.tm_sec, text);
     std::size_t size = std::min(static_cast<std::size_t>(std::max(length, 0)), sizeof line - 1);
@@ -33,7 +39,7 @@ void daemon::log_line(event_type type, int colour_number, const char* format, va
         std::fwrite(line, 1, size, stdout);
     else
         held_lines_.append(line, size);
-    if (logging)
+    if (settings_.logging)
         platform::write_event_record(type, text);
 }
 
@@ -42,36 +48,6 @@ daemon::console_hold::~console_hold() {
         return;
     std::fwrite(owner_.held_lines_.data(), 1, owner_.held_lines_.size(), stdout);
     owner_.held_lines_.clear();
-}
-
-void daemon::log_error(const char* format, ...) {
-    va_list args;
-    va_start(args, format);
-    log_line(event_type::error, colour_red, format, args);
-    va_end(args);
-}
-
-void daemon::log_warning(const char* format, ...) {
-    va_list args;
-    va_start(args, format);
-    log_line(event_type::warning, colour_yellow, format, args);
-    va_end(args);
-}
-
-void daemon::log_info(const char* format, ...) {
-    va_list args;
-    va_start(args, format);
-    log_line(event_type::information, colour_green, format, args);
-    va_end(args);
-}
-
-void daemon::log_verbose(const char* format, ...) {
-    if (!verbose)
-        return;
-    va_list args;
-    va_start(args, format);
-    log_line(event_type::information, colour_green, format, args);
-    va_end(args);
 }
 
 } // namespace torvad

@@ -23,7 +23,7 @@ void daemon::wait_for_orphans() {
             return;
         // Behind what is ready already: a supervised child's end, and its
         // restart, need not wait for a scan of the others.
-        boost::asio::post(*this, [this] {
+        boost::asio::post(loop_, [this] {
             reap_orphans();
             wait_for_orphans();
         });
@@ -34,7 +34,7 @@ void daemon::reap_orphans() {
     // A supervised child's end stands in front of the others; its exit wait,
     // queued already, takes its status, and this comes again behind it.
     if (!platform::reap_orphans(orphan_watch_))
-        boost::asio::post(*this, [this] { reap_orphans(); });
+        boost::asio::post(loop_, [this] { reap_orphans(); });
 }
 
 } // namespace torvad

@@ -2,7 +2,7 @@
 
 #include <cstdlib>
 
-#include "daemon/daemon.hpp"
+#include "ipc/packet.hpp"
 
 namespace torvad {
 
@@ -77,7 +77,7 @@ command_line scan_command_line(int argc, char** argv) {
 }
 
 std::string help_text(const char* program) {
-    return std::string("torvad version ") + daemon_version + "\nUsage: " + program +
+    return std::string("torvad version ") + torvad_version + "\nUsage: " + program +
            " <options> -- <exe> <exe args>\n"
            "  -h  help\n"
            "  -v  verbose\n"

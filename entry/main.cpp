@@ -1,4 +1,5 @@
-// torvad: supervises the product's programs. main reads as its steps.
+// torvad: supervises the product's programs. main reads as its steps, and
+// owns the daemon from its first step to its last.
 #include <csignal>
 #include <cstdio>
 
@@ -11,80 +12,94 @@
 #include "platform/platform.hpp"
 #include "process/process.hpp"
 
-using namespace torvad;
-
+namespace torvad {
 namespace {
+
+settings settings_of(const command_line& options) {
+    return {.verbose = options.verbose,
+            .logging = options.logging,
+            .background = options.background || !platform::stdout_is_terminal(),
+            .auto_restart = !options.no_restart};
+}
 
 // The name is made absolute before the working directory changes, so that the
 // removal at the end reaches the file this run created.
-std::string write_pid_file(const char* name) {
+std::string write_pid_file(daemon& supervisor, const char* name) {
     if (name == nullptr)
         return {};
     platform::os_error ignored;
     std::string path = platform::absolute_path(name, ignored);
     if (platform::write_pid_file(path, platform::current_process_id()))
         return path;
-    the_daemon.log_error("failed to create pid file");
+    supervisor.log_error("failed to create pid file");
     return {};
 }
 
-void choose_what_to_supervise(command_line& options) {
+void choose_what_to_supervise(daemon& supervisor, command_line& options) {
     if (options.command.empty() && options.attach_pid == 0) {
         // The server program wins when both products are installed here.
         if (platform::path_exists(std::string("core") + platform::exe_suffix))
-            start_server_family(options.family);
+            start_server_family(supervisor, options.family);
         else if (platform::path_exists(std::string("wfe") + platform::exe_suffix))
-            start_web_service();
+            start_web_service(supervisor);
         return;
     }
-    auto top = process::create(&the_daemon, {.command = std::move(options.command),
-                                             .user = std::move(options.user),
-                                             .working_directory = ".",
-                                             .persistent = true,
-                                             .stdio_mode = stdio_inherit});
+    auto top = process::create(supervisor, {.command = std::move(options.command),
+                                            .user = std::move(options.user),
+                                            .working_directory = ".",
+                                            .persistent = true,
+                                            .stdio_mode = stdio_inherit});
     // Attached before the program's name is known, so its version packet
     // names no program: peers that attach have always seen it so.
     if (options.attach_pid != 0)
         top->attach(options.attach_pid, options.attach_pipe);
-    the_daemon.configure("torvad", nullptr);
+    supervisor.configure("torvad", nullptr);
 }
 
 // A stop request can come while the product's start runs its programs. At a
 // console a plain kill is one too, taken by the loop once it runs; under the
 // service manager it waits, blocked, for the dispatcher to act on it.
-void take_stop_requests() {
+void take_stop_requests(daemon& supervisor, bool background) {
     if (background)
         platform::hold_stop_requests();
     else
-        the_daemon.add_stop_signal(SIGTERM);
+        supervisor.add_stop_signal(SIGTERM);
 }
 
-void run_at_console() {
-    the_daemon.start();
-    the_daemon.run();
+void supervise(daemon& supervisor, bool background) {
+    if (!background) {
+        supervisor.start();
+        supervisor.run();
+        return;
+    }
+    service_run service(supervisor);
+    // Outside a service manager this fails at once and nothing was started:
+    // the run simply ends, so its result changes nothing here.
+    (void)platform::run_service_dispatcher(
+        supervisor.service_name(), [&service] { service.main(); },
+        [&service] { service.control_stop(); });
 }
 
 } // namespace
 
-int main(int argc, char** argv) {
-    // The start state (standard fds, signal dispositions) was made before the
-    // daemon was built; see daemon.cpp.
+// The program's steps, in the order they run.
+int run_program(int argc, char** argv) {
+    // The start state (standard fds, signal dispositions) comes before any
+    // descriptor of ours, so none can take a standard stream's number.
+    platform::prepare_own_process();
     platform::unbuffer_output();
-    background = !platform::stdout_is_terminal();
 
     command_line options = scan_command_line(argc, argv);
     if (options.help) {
         std::fputs(help_text(argv[0]).c_str(), stderr);
         return 0;
     }
-    verbose = options.verbose;
-    logging = options.logging;
-    background = background || options.background;
-    auto_restart = !options.no_restart;
+    settings chosen = settings_of(options);
+    daemon supervisor(chosen);
     // Before the start runs any program or thread: see daemon/orphans.cpp.
-    the_daemon.take_orphans();
+    supervisor.take_orphans();
 
-    std::string pid_file = write_pid_file(options.pid_file);
+    std::string pid_file = write_pid_file(supervisor, options.pid_file);
     platform::os_error ignored;
     boost::filesystem::path exe_path = platform::absolute_path(argv[0], ignored);
     if (options.directory.empty())
@@ -93,19 +108,19 @@ int main(int argc, char** argv) {
     // names are then looked up there. Operators rely on the run going on.
     platform::change_directory(options.directory);
 
-    take_stop_requests();
-    choose_what_to_supervise(options);
-    the_daemon.set_program_name(exe_path.filename().string());
-
-    if (!background)
-        run_at_console();
-    else
-        // Outside a service manager this fails at once and nothing was
-        // started: the run simply ends, so its result changes nothing here.
-        (void)platform::run_service_dispatcher(the_daemon.service_name(), run_service,
-                                               service_control_stop);
+    take_stop_requests(supervisor, chosen.background);
+    choose_what_to_supervise(supervisor, options);
+    supervisor.set_program_name(exe_path.filename().string());
+    supervise(supervisor, chosen.background);
+    supervisor.shut_down();
 
     if (!pid_file.empty())
         platform::remove_file(pid_file);
     return 0;
+}
+
+} // namespace torvad
+
+int main(int argc, char** argv) {
+    return torvad::run_program(argc, argv);
 }

@@ -1,7 +1,5 @@
 #include "entry/product_start.hpp"
 
-#include <cerrno>
-
 #include <boost/filesystem/path.hpp>
 
 #include "daemon/daemon.hpp"
@@ -26,7 +24,7 @@ constexpr std::size_t account_cap = 4096;
 platform::program_end run_init_script(first_line_reader& account) {
     std::string interpreter = platform::search_path("powershell");
     if (interpreter.empty())
-        return {.error = ENOENT};
+        return {.error = platform::error_not_found};
     platform::os_error error;
     auto script =
         boost::filesystem::path(platform::absolute_path(".", error)) / "scripts" / "init.ps1";
@@ -42,46 +40,46 @@ platform::program_end run_init_script(first_line_reader& account) {
 
 // The account the init script names for core, or empty: core then runs under
 // our own account. A failing script never stops the server, it only says so.
-std::string core_account() {
+std::string core_account(daemon& supervisor) {
     try {
         first_line_reader account(account_cap, true);
         platform::program_end end = run_init_script(account);
         if (end.error == 0 && end.exit_code == 0)
             return account.text();
         if (end.error == 0) {
-            the_daemon.log_error("server init script exited with '%d', will not deelevate.",
+            supervisor.log_error("server init script exited with '%d', will not deelevate.",
                                  end.exit_code);
             return {};
         }
     } catch (...) {
     }
-    the_daemon.log_error("failed to execute server init script, will not deelevate.");
+    supervisor.log_error("failed to execute server init script, will not deelevate.");
     return {};
 }
 
 } // namespace
 
-void start_server_family(const std::string& family) {
+void start_server_family(daemon& supervisor, const std::string& family) {
     std::string service_name = family + "Server";
     // Decided before the script runs: a file the script makes counts next time.
     bool patterns_present = platform::path_exists(patterns_name);
     check_service_program(service_name);
-    std::string user = core_account();
-    process::create(&the_daemon, {.command = {"./core"},
-                                  .user = std::move(user),
-                                  .working_directory = ".",
-                                  .persistent = true,
-                                  .stdio_mode = stdio_inherit});
-    the_daemon.configure(service_name, patterns_present ? patterns_name : nullptr);
+    std::string user = core_account(supervisor);
+    process::create(supervisor, {.command = {"./core"},
+                                 .user = std::move(user),
+                                 .working_directory = ".",
+                                 .persistent = true,
+                                 .stdio_mode = stdio_inherit});
+    supervisor.configure(service_name, patterns_present ? patterns_name : nullptr);
 }
 
-void start_web_service() {
-    process::create(&the_daemon, {.command = {"./wfe"},
-                                  .user = "NT Authority\\LocalService",
-                                  .working_directory = ".",
-                                  .persistent = true,
-                                  .stdio_mode = stdio_inherit});
-    the_daemon.configure("WebService", nullptr);
+void start_web_service(daemon& supervisor) {
+    process::create(supervisor, {.command = {"./wfe"},
+                                 .user = "NT Authority\\LocalService",
+                                 .working_directory = ".",
+                                 .persistent = true,
+                                 .stdio_mode = stdio_inherit});
+    supervisor.configure("WebService", nullptr);
 }
 
 } // namespace torvad

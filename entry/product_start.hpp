@@ -7,12 +7,14 @@
 
 namespace torvad {
 
+class daemon;
+
 // Asks core whether to stay in front of it (this may end the process), runs
 // the init script for core's account, and names the service family + "Server".
 // No exception leaves it but those of process::create and daemon::configure.
-void start_server_family(const std::string& family);
+void start_server_family(daemon& supervisor, const std::string& family);
 
 // wfe under the local service account, service "WebService", no patterns file.
-void start_web_service();
+void start_web_service(daemon& supervisor);
 
 } // namespace torvad

@@ -79,6 +79,9 @@ packet_header read_packet_header(const void* in);
 std::vector<char> encode_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
                                 const void* data, std::size_t size);
 
+// This build's version, which the build names once.
+inline constexpr const char* torvad_version = TORVAD_VERSION;
+
 // The payload of version: program name, version text and "Background:true|false",
 // joined by NUL bytes with none at the end.
 std::string version_payload(std::string_view program_name, std::string_view version,

@@ -22,6 +22,15 @@ namespace torvad::platform {
 // The executable suffix of this system: empty on Linux, ".exe" on Windows.
 extern const char* const exe_suffix;
 
+// The system's code for "no such file": what a search that finds nothing reports.
+extern const int error_not_found;
+
+// The status of a program killed by signal: counted as a failure, as a shell
+// reports it.
+constexpr std::uint32_t signal_status(int signal_number) {
+    return 128 + static_cast<std::uint32_t>(signal_number);
+}
+
 // A failed system call: the system's error code (errno, or GetLastError) and
 // the call's name, for a log line that says which call failed and why. code 0
 // is success.
@@ -156,7 +165,10 @@ struct exit_status {
 // The end of the child behind watch, if it has ended; it is reaped then.
 exit_status exit_status_of(exit_watch& watch);
 // Ends the child by force (TerminateProcess with 0 on Windows).
-void end_by_force(exit_watch& watch);
+os_error end_by_force(exit_watch& watch);
+// Continues the child if a terminal's job control has stopped it (it read the
+// terminal from a background group); true when it was stopped. Never on Windows.
+bool continue_if_stopped(exit_watch& watch);
 // Ends the child by force and releases it, all before returning: for a child
 // whose exit can't be watched.
 void end_now(owned_handle& process);

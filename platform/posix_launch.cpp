@@ -287,19 +287,36 @@ exit_status exit_status_of(exit_watch& watch) {
 }
 
 namespace {
-void kill_child(int pidfd) {
-    syscall(SYS_pidfd_send_signal, pidfd, SIGKILL, nullptr, 0);
+os_error signal_child(int pidfd, int signal_number) {
+    if (syscall(SYS_pidfd_send_signal, pidfd, signal_number, nullptr, 0) == -1)
+        return {errno, "pidfd_send_signal"};
+    return {};
 }
 } // namespace
 
-void end_by_force(exit_watch& watch) {
-    kill_child(watch.native_handle());
+os_error end_by_force(exit_watch& watch) {
+    return signal_child(watch.native_handle(), SIGKILL);
+}
+
+bool continue_if_stopped(exit_watch& watch) {
+    // WNOWAIT leaves the stop to be seen again: the next stop request asks
+    // anew. Not through wait_supervised, which takes what it sees for an end.
+    siginfo_t info{};
+    if (waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(watch.native_handle()), &info,
+               WSTOPPED | WNOHANG | WNOWAIT) == -1)
+        return false;
+    if (info.si_pid == 0 || info.si_code != CLD_STOPPED)
+        return false;
+    return !signal_child(watch.native_handle(), SIGCONT);
 }
 
 void end_now(owned_handle& process) {
-    kill_child(process.get());
+    // A child we can't watch is one we never started as far as anyone knows:
+    // a failed kill leaves nothing better to do than reap what we can.
+    (void)signal_child(process.get(), SIGKILL);
     siginfo_t info{};
-    wait_supervised(process.get(), info, WEXITED);
+    if (wait_supervised(process.get(), info, WEXITED) == -1)
+        info.si_pid = 0;
     process.reset();
 }
 

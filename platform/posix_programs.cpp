@@ -57,7 +57,8 @@ int wait_for_exit_code(int pidfd) {
     siginfo_t info{};
     if (wait_supervised(pidfd, info, WEXITED) == -1)
         return -1;
-    return info.si_code == CLD_EXITED ? info.si_status : 128 + info.si_status;
+    return info.si_code == CLD_EXITED ? info.si_status
+                                      : static_cast<int>(signal_status(info.si_status));
 }
 
 } // namespace

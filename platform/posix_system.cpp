@@ -12,6 +12,7 @@
 namespace torvad::platform {
 
 const char* const exe_suffix = "";
+const int error_not_found = ENOENT;
 
 std::string describe(const os_error& error) {
     return std::string(error.call) + ": " + std::strerror(error.code);

@@ -86,12 +86,21 @@ exit_status exit_status_of(exit_watch& watch) {
     return {true, true, static_cast<int>(code), {}};
 }
 
-void end_by_force(exit_watch& watch) {
-    TerminateProcess(watch.native_handle(), 0);
+os_error end_by_force(exit_watch& watch) {
+    if (!TerminateProcess(watch.native_handle(), 0))
+        return {static_cast<int>(GetLastError()), "TerminateProcess"};
+    return {};
+}
+
+// A console's job control never stops a child here.
+bool continue_if_stopped(exit_watch&) {
+    return false;
 }
 
 void end_now(owned_handle& process) {
-    TerminateProcess(process.get(), 0);
+    // A child we can't watch is one we never started as far as anyone knows:
+    // a failed kill leaves nothing better to do than let the handle go.
+    (void)TerminateProcess(process.get(), 0);
     process.reset();
 }
 

@@ -12,6 +12,7 @@
 namespace torvad::platform {
 
 const char* const exe_suffix = ".exe";
+const int error_not_found = ERROR_FILE_NOT_FOUND;
 
 std::string describe(const os_error& error) {
     char text[512];

@@ -4,7 +4,6 @@
 
 #include <boost/filesystem/path.hpp>
 
-#include "daemon/daemon.hpp"
 #include "ipc/strings.hpp"
 
 namespace torvad {
@@ -26,7 +25,7 @@ platform::os_error resolve_executable(std::vector<std::string>& argv) {
     if (argv[0].find_first_of("/\\") == std::string::npos) {
         argv[0] = platform::search_path(argv[0]);
         if (argv[0].empty())
-            return {ENOENT, "search PATH"};
+            return {platform::error_not_found, "search PATH"};
     }
     platform::os_error error;
     argv[0] = platform::absolute_path(argv[0], error);
@@ -46,43 +45,40 @@ std::string command_line_of(const std::vector<std::string>& argv) {
 
 bool process::fail_launch(std::uint32_t failure_status, const platform::os_error& error) {
     if (error)
-        owner->log_verbose("%s", platform::describe(error).c_str());
+        owner.log_verbose("%s", platform::describe(error).c_str());
     finish(failure_status, packet_failed);
     return false;
 }
 
 bool process::prepare_stdio(platform::launch_request& request,
                             platform::owned_handle (&theirs)[3]) {
-    if (stdio_mode == stdio_none)
+    if (stdio_mode_ == stdio_none)
         request.stdio = platform::stdio_source::none;
-    if (stdio_mode != stdio_pipes)
+    if (stdio_mode_ != stdio_pipes)
         return true;
     request.stdio = platform::stdio_source::handles;
-    platform::stream* ours[3] = {&stdin_pipe, &stdout_pipe, &stderr_pipe};
-    for (int stream = 0; stream < 3; ++stream) {
-        if (platform::os_error error =
-                platform::make_relay_pipe(stream, *ours[stream], theirs[stream])) {
-            close_pipes();
-            owner->log_error("failed to create child process.");
-            return fail_launch(error.code, error);
-        }
-        request.stdio_handles[stream] = theirs[stream].get();
+    if (platform::os_error error = streams_.make(theirs)) {
+        close_pipes();
+        owner.log_error("failed to create child process.");
+        return fail_launch(error.code, error);
     }
+    for (int stream = 0; stream < 3; ++stream)
+        request.stdio_handles[stream] = theirs[stream].get();
     return true;
 }
 
 bool process::start() {
-    if (pid != 0)
+    if (child_.pid() != 0)
         return true;
     if (command.empty() || command[0].empty()) {
         // Nothing to launch would leave an object that never ends and keeps
         // the run alive; finish it like any failed launch.
-        owner->log_error("executable not specified");
+        owner.log_error("executable not specified");
         return fail_launch(status_malformed, {});
     }
     std::vector<std::string> argv = command;
     if (platform::os_error error = resolve_executable(argv)) {
-        owner->log_error("executable '%s' not found.", command[0].c_str());
+        owner.log_error("executable '%s' not found.", command[0].c_str());
         return fail_launch(status_not_found, error);
     }
     platform::launch_request request;
@@ -91,8 +87,8 @@ bool process::start() {
     if (!prepare_stdio(request, child_stdio))
         return false;
     if (persistent) {
-        if (platform::os_error error = create_ipc_pipe(child_ipc)) {
-            owner->log_error("failed to create ipc pipe.");
+        if (platform::os_error error = link_.make(child_ipc)) {
+            owner.log_error("failed to create ipc pipe.");
             return fail_launch(error.code, error);
         }
         request.ipc = child_ipc.get();
@@ -105,37 +101,33 @@ bool process::start() {
     request.user = user;
     // At a console the terminal signals its whole foreground group; only
     // we are to hear Ctrl-C, and stop the children in order.
-    request.own_process_group = !background;
+    request.own_process_group = !owner.facts().background;
     platform::launch_result launched = platform::launch_child(request);
     // The child has its copies of these now, or never will.
     child_ipc.reset();
     for (auto& end : child_stdio)
         end.reset();
     if (launched.failed_step == platform::launch_step::logon) {
-        owner->log_warning("Failed to logon as user '%s': error %d", user.c_str(),
-                           launched.error.code);
+        owner.log_warning("Failed to logon as user '%s': error %d", user.c_str(),
+                          launched.error.code);
         return fail_launch(status_not_found, launched.error);
     }
     if (launched.failed_step != platform::launch_step::none) {
-        owner->log_error("failed to create child process.");
+        owner.log_error("failed to create child process.");
         return fail_launch(launched.error.code, launched.error);
     }
-    watch_child(launched);
-    return true;
+    return watch_child(launched);
 }
 
-void process::watch_child(platform::launch_result& launched) {
-    pid = static_cast<std::uint32_t>(launched.pid);
-    if (platform::os_error error = platform::watch_exit(exit_watch, launched.process)) {
-        // Without its exit in the loop we could never see it end: end the
-        // child now rather than leave it unwatched.
-        platform::end_now(launched.process);
-        owner->log_error("failed to create child process.");
-        fail_launch(error.code, error);
-        return;
+bool process::watch_child(platform::launch_result& launched) {
+    if (platform::os_error error = child_.watch(launched)) {
+        // Without its exit in the loop we could never see it end; the child
+        // was ended at once, so this start failed.
+        owner.log_error("failed to create child process.");
+        return fail_launch(error.code, error);
     }
     wait_for_exit();
-    if (stdio_mode == stdio_pipes) {
+    if (stdio_mode_ == stdio_pipes) {
         wait_output(1);
         wait_output(2);
     }
@@ -144,14 +136,14 @@ void process::watch_child(platform::launch_result& launched) {
         send_version();
     }
     if (auto requester = parent.lock())
-        requester->send_packet(channel, packet_opened, pid, nullptr, 0);
+        requester->send_packet(channel, packet_opened, child_.pid(), nullptr, 0);
+    return true;
 }
 
 void process::wait_for_exit() {
-    platform::await_exit(exit_watch,
-                         [self = shared_from_this()](const boost::system::error_code& error) {
-                             self->on_exit(error);
-                         });
+    child_.await_end([self = shared_from_this()](const boost::system::error_code& error) {
+        self->on_exit(error);
+    });
 }
 
 } // namespace torvad

@@ -2,6 +2,7 @@
 #include <gtest/gtest.h>
 
 #include "entry/command_line.hpp"
+#include "ipc/packet.hpp"
 
 namespace {
 
@@ -46,16 +47,17 @@ TEST(command_line, options_values_and_the_end_of_the_scan) {
 }
 
 TEST(command_line, help_names_the_program_and_every_option) {
-    EXPECT_EQ(torvad::help_text("prog"), "torvad version 1.1.21.0\n"
-                                         "Usage: prog <options> -- <exe> <exe args>\n"
-                                         "  -h  help\n"
-                                         "  -v  verbose\n"
-                                         "  -l  enable logging\n"
-                                         "  -b  start service\n"
-                                         "  -o  disable auto restart after failure\n"
-                                         "  -f  <product family>\n"
-                                         "  -u  <user>\n"
-                                         "  -d  <directory>\n"
-                                         "  -p  <pid file>\n"
-                                         "  -a  <pid> <pipe>\n");
+    EXPECT_EQ(torvad::help_text("prog"), std::string("torvad version ") + torvad::torvad_version +
+                                             "\n"
+                                             "Usage: prog <options> -- <exe> <exe args>\n"
+                                             "  -h  help\n"
+                                             "  -v  verbose\n"
+                                             "  -l  enable logging\n"
+                                             "  -b  start service\n"
+                                             "  -o  disable auto restart after failure\n"
+                                             "  -f  <product family>\n"
+                                             "  -u  <user>\n"
+                                             "  -d  <directory>\n"
+                                             "  -p  <pid file>\n"
+                                             "  -a  <pid> <pipe>\n");
 }

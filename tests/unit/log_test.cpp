@@ -7,20 +7,20 @@
 
 #include "daemon/daemon.hpp"
 
-using torvad::the_daemon;
+using supervisor = torvad::daemon;
 
 TEST(log, line_forms_by_level_colour_and_length) {
     const std::string time = R"(\d\d:\d\d:\d\d)", tag = "\x1b\\[36m torvad\x1b\\[0m ";
-    const std::tuple<bool, void (*)(), std::string> rows[] = {
-        {false, [] { the_daemon.log_info("%s", "100%d"); }, "^" + time + " torvad 100%d\n$"},
-        {true, [] { the_daemon.log_error("bad"); }, "^\x1b\\[31m" + time + tag + "bad\n$"},
-        {true, [] { the_daemon.log_warning("so"); }, "^\x1b\\[33m" + time + tag + "so\n$"},
-        {true, [] { the_daemon.log_info("ok"); }, "^\x1b\\[32m" + time + tag + "ok\n$"},
-        {false, [] { the_daemon.log_verbose("hidden %s", "x"); }, "^$"},
-        {false, [] { the_daemon.log_info("%s", std::string(5000, 'y').c_str()); },
+    const std::tuple<bool, void (*)(supervisor&), std::string> rows[] = {
+        {false, [](supervisor& d) { d.log_info("%s", "100%d"); }, "^" + time + " torvad 100%d\n$"},
+        {true, [](supervisor& d) { d.log_error("bad"); }, "^\x1b\\[31m" + time + tag + "bad\n$"},
+        {true, [](supervisor& d) { d.log_warning("so"); }, "^\x1b\\[33m" + time + tag + "so\n$"},
+        {true, [](supervisor& d) { d.log_info("ok"); }, "^\x1b\\[32m" + time + tag + "ok\n$"},
+        {false, [](supervisor& d) { d.log_verbose("hidden %s", "x"); }, "^$"},
+        {false, [](supervisor& d) { d.log_info("%s", std::string(5000, 'y').c_str()); },
          "^" + time + " torvad y{4095}\n$"},
     };
-    bool colour = the_daemon.colour();
+    supervisor the_daemon({});
     for (const auto& [coloured, log, pattern] : rows) {
         // The line goes to a file standing in for stdout.
         the_daemon.set_colour(coloured);
@@ -28,7 +28,7 @@ TEST(log, line_forms_by_level_colour_and_length) {
         std::FILE* sink = std::tmpfile();
         int saved = dup(1);
         dup2(fileno(sink), 1);
-        log();
+        log(the_daemon);
         std::fflush(stdout);
         dup2(saved, 1);
         close(saved);
@@ -38,5 +38,4 @@ TEST(log, line_forms_by_level_colour_and_length) {
         std::fclose(sink);
         EXPECT_TRUE(std::regex_match(line, std::regex(pattern))) << line;
     }
-    the_daemon.set_colour(colour);
 }

@@ -38,7 +38,7 @@ TEST(trace, details_by_packet_type) {
         {9, 7, "zz", "unknown", ""},
         {packet_execute, 9, join_strings({"svc", "a\"b", ""}), "execute",
          "\"svc\" \"a\\\"b\" \"\" flags=0x9"},
-        {packet_version, 0, version_payload("torvad", "1.1.21.0", false), "version",
+        {packet_version, 0, version_payload("torvad", torvad_version, false), "version",
          "\"torvad\" \"1.1.21.0\" \"Background:false\" "},
     };
     for (const auto& r : rows) {
