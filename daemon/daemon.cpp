@@ -133,8 +133,6 @@ void daemon::persistent_children_changed() {
 }
 
 void daemon::run() {
-    // A loop stopped before (by a stop control) runs again from here.
-    loop_.restart();
     // Handlers report failures by result, not by exception; what can still
     // come out of one is an allocation that failed. The loop logs it and goes
     // on, so that one child's bad moment doesn't end the others' supervision.
@@ -146,6 +144,14 @@ void daemon::run() {
             log_error("internal error: %s", failure.what());
         }
     }
+}
+
+void daemon::stop_and_run_to_end() {
+    stop_children();
+    // A stop control stopped the loop, maybe before the first run began;
+    // only now, with the children asked to end, may it run again.
+    loop_.restart();
+    run();
 }
 
 void daemon::stop_loop() {

@@ -59,8 +59,10 @@ class daemon final : public process_owner {
     void start();
     // The stop of the supervised: log, terminate the children, no more restarts.
     void stop_children();
-    // Runs the loop while a persistent child is left (again after stop_loop).
+    // Runs the loop while a persistent child is left, or until stop_loop.
     void run();
+    // After a stop control: stop_children, then run the loop again for their end.
+    void stop_and_run_to_end();
     // Makes run() return; the one way the loop is stopped, from any thread.
     void stop_loop();
     // Closes everything still open and runs the loop until no handler is

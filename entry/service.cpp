@@ -22,8 +22,7 @@ void service_run::main() {
         first_run_over_ = true;
     }
     platform::report_service_state(service_state::stop_pending, daemon_.persistent_count());
-    daemon_.stop_children();
-    daemon_.run();
+    daemon_.stop_and_run_to_end();
     platform::report_service_state(service_state::stopped, 0);
 }
 
