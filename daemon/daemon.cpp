@@ -128,7 +128,8 @@ void daemon::persistent_children_changed() {
     children_report_posted_ = true;
     boost::asio::post(loop_, [this] {
         children_report_posted_ = false;
-        platform::report_service_children(persistent_count());
+        if (platform::os_error error = platform::report_service_children(persistent_count()))
+            log_verbose("%s", platform::describe(error).c_str());
     });
 }
 

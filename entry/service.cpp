@@ -7,13 +7,19 @@
 
 namespace torvad {
 
+void service_run::report(platform::service_state state, std::size_t children) {
+    // The manager not hearing us changes nothing we could do; -v says so.
+    if (platform::os_error error = platform::report_service_state(state, children))
+        daemon_.log_verbose("%s", platform::describe(error).c_str());
+}
+
 void service_run::main() {
     using platform::service_state;
-    platform::report_service_state(service_state::start_pending, 0);
+    report(service_state::start_pending, 0);
     daemon_.start();
     // Running holds whatever the start did; a failed start shows in the log
     // and in the number of children the status names.
-    platform::report_service_state(service_state::running, daemon_.persistent_count());
+    report(service_state::running, daemon_.persistent_count());
     daemon_.run();
     {
         // A stop still on its way has stopped the loop before this point, and
@@ -21,9 +27,9 @@ void service_run::main() {
         std::lock_guard<std::mutex> lock(first_run_guard_);
         first_run_over_ = true;
     }
-    platform::report_service_state(service_state::stop_pending, daemon_.persistent_count());
+    report(service_state::stop_pending, daemon_.persistent_count());
     daemon_.stop_and_run_to_end();
-    platform::report_service_state(service_state::stopped, 0);
+    report(service_state::stopped, 0);
 }
 
 void service_run::control_stop() {

@@ -2,7 +2,10 @@
 // thread, while stop controls arrive on the first one.
 #pragma once
 
+#include <cstddef>
 #include <mutex>
+
+#include "platform/platform.hpp"
 
 namespace torvad {
 
@@ -20,6 +23,8 @@ class service_run {
     void control_stop();
 
   private:
+    void report(platform::service_state state, std::size_t children);
+
     daemon& daemon_;
     // A stop control ends the first run of the loop only: the second run is
     // the children's orderly end, and a repeated stop must not cut it short.

@@ -201,9 +201,9 @@ bool run_service_dispatcher(const std::string& name, const std::function<void()>
 enum class service_state { start_pending, running, stop_pending, stopped };
 // children: the number of persistent children, which the status text of the
 // running and stopping states names where the service manager shows one.
-void report_service_state(service_state state, std::size_t children);
+os_error report_service_state(service_state state, std::size_t children);
 // A change of that number while running or stopping; nothing otherwise.
-void report_service_children(std::size_t count);
+os_error report_service_children(std::size_t count);
 
 } // namespace torvad::platform
 

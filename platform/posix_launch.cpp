@@ -183,6 +183,13 @@ struct low_slots {
     int last = -1;
 };
 
+void release(low_slots& slots) {
+    for (int fd : {slots.null_fd, slots.stdio[0], slots.stdio[1], slots.stdio[2], slots.ipc})
+        if (fd != -1)
+            close(fd);
+    slots = {};
+}
+
 os_error reserve(low_slots& slots) {
     if (slots.last != -1)
         return {};
@@ -195,9 +202,7 @@ os_error reserve(low_slots& slots) {
         *slot = fcntl(made.null_fd, F_DUPFD_CLOEXEC, 3);
         if (*slot == -1) {
             os_error error{errno, "fcntl"};
-            for (int fd : {made.null_fd, made.stdio[0], made.stdio[1], made.stdio[2]})
-                if (fd != -1)
-                    close(fd);
+            release(made);
             return error;
         }
         made.last = std::max(made.last, *slot);
@@ -210,10 +215,16 @@ os_error reserve(low_slots& slots) {
 // slot never holds a child's descriptor past its launch.
 class slot_filling {
   public:
-    explicit slot_filling(const low_slots& slots) : slots_(slots) {}
+    explicit slot_filling(low_slots& slots) : slots_(slots) {}
     ~slot_filling() {
+        bool refilled = true;
         for (int i = 0; i < filled_; ++i)
-            dup3(slots_.null_fd, used_[i], O_CLOEXEC);
+            if (dup3(slots_.null_fd, used_[i], O_CLOEXEC) == -1)
+                refilled = false;
+        // A slot that kept a child's end would hold its pipe open: give them
+        // all up, and the next launch takes new ones.
+        if (!refilled)
+            release(slots_);
     }
     slot_filling(const slot_filling&) = delete;
     slot_filling& operator=(const slot_filling&) = delete;
@@ -226,7 +237,7 @@ class slot_filling {
     }
 
   private:
-    const low_slots& slots_;
+    low_slots& slots_;
     int used_[4] = {};
     int filled_ = 0;
 };

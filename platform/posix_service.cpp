@@ -71,22 +71,24 @@ namespace {
 // The notify protocol is one datagram of text to the socket the manager
 // named; that is all the supervisor needs of the manager's client library,
 // which would bring six more libraries into every run.
-void notify_service_manager(const char* state) {
+os_error notify_service_manager(const char* state) {
     const char* path = std::getenv("NOTIFY_SOCKET");
     sockaddr_un address{};
     std::size_t length = path == nullptr ? 0 : std::strlen(path);
     if (length == 0 || length >= sizeof address.sun_path)
-        return;
+        return {};
     address.sun_family = AF_UNIX;
     std::memcpy(address.sun_path, path, length);
     if (address.sun_path[0] == '@')
         address.sun_path[0] = '\0'; // an abstract socket
-    int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-    if (fd == -1)
-        return;
-    sendto(fd, state, std::strlen(state), MSG_NOSIGNAL, reinterpret_cast<sockaddr*>(&address),
-           static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + length));
-    close(fd);
+    owned_handle fd(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+    if (!fd.valid())
+        return {errno, "socket"};
+    if (sendto(fd.get(), state, std::strlen(state), MSG_NOSIGNAL,
+               reinterpret_cast<sockaddr*>(&address),
+               static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + length)) == -1)
+        return {errno, "sendto"};
+    return {};
 }
 
 // The state last reported and the persistent children last counted: the
@@ -115,20 +117,21 @@ std::string status_text(service_state state) {
 
 } // namespace
 
-void report_service_state(service_state state, std::size_t children) {
+os_error report_service_state(service_state state, std::size_t children) {
     static const char* const changes[] = {"", "READY=1\n", "STOPPING=1\n", ""};
     reported_state = state;
     counted_children = children;
-    notify_service_manager(
+    return notify_service_manager(
         (changes[static_cast<int>(state)] + ("STATUS=" + status_text(state))).c_str());
 }
 
-void report_service_children(std::size_t count) {
+os_error report_service_children(std::size_t count) {
     if (count == counted_children)
-        return;
+        return {};
     counted_children = count;
-    if (reported_state == service_state::running || reported_state == service_state::stop_pending)
-        notify_service_manager(("STATUS=" + status_text(reported_state)).c_str());
+    if (reported_state != service_state::running && reported_state != service_state::stop_pending)
+        return {};
+    return notify_service_manager(("STATUS=" + status_text(reported_state)).c_str());
 }
 
 } // namespace torvad::platform

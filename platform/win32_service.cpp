@@ -43,17 +43,21 @@ bool run_service_dispatcher(const std::string& name, const std::function<void()>
     return StartServiceCtrlDispatcherA(table) != 0;
 }
 
-void report_service_state(service_state state, std::size_t) {
+os_error report_service_state(service_state state, std::size_t) {
     static const DWORD states[] = {SERVICE_START_PENDING, SERVICE_RUNNING, SERVICE_STOP_PENDING,
                                    SERVICE_STOPPED};
     SERVICE_STATUS status{};
     status.dwServiceType = SERVICE_WIN32_OWN_PROCESS;
     status.dwCurrentState = states[static_cast<int>(state)];
     status.dwControlsAccepted = SERVICE_ACCEPT_STOP | SERVICE_ACCEPT_SHUTDOWN;
-    SetServiceStatus(status_handle, &status);
+    if (!SetServiceStatus(status_handle, &status))
+        return {static_cast<int>(GetLastError()), "SetServiceStatus"};
+    return {};
 }
 
 // The record has no text to name the children in.
-void report_service_children(std::size_t) {}
+os_error report_service_children(std::size_t) {
+    return {};
+}
 
 } // namespace torvad::platform
