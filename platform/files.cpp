@@ -18,6 +18,13 @@ bool write_pid_file(const std::string& path, int pid) {
     return std::fclose(file) == 0;
 }
 
+account_name split_account(const std::string& user) {
+    auto slash = user.find('\\');
+    if (slash == std::string::npos)
+        return {{}, user};
+    return {user.substr(0, slash), user.substr(slash + 1)};
+}
+
 void remove_file(const std::string& path) {
     std::remove(path.c_str());
 }

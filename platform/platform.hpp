@@ -72,6 +72,13 @@ os_error read_file(const std::string& path, std::string& content);
 // True when something of any type stands at path (a directory counts too).
 bool path_exists(const std::string& path);
 
+// An account as "domain\name", split at its first backslash; no backslash:
+// an empty domain.
+struct account_name {
+    std::string domain, name;
+};
+account_name split_account(const std::string& user);
+
 // Runs work on a thread with a stack of stack_bytes and waits for it; what
 // work throws is thrown here. False when no such thread could be had.
 bool run_on_large_stack(std::size_t stack_bytes, const std::function<void()>& work);

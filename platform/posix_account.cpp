@@ -13,9 +13,7 @@ namespace torvad::platform {
 namespace {
 
 std::string local_account_name(const std::string& user, bool& this_machine) {
-    auto slash = user.find('\\');
-    std::string domain = slash == std::string::npos ? std::string() : user.substr(0, slash);
-    std::string name = slash == std::string::npos ? user : user.substr(slash + 1);
+    auto [domain, name] = split_account(user);
     bool nt_authority = strcasecmp(domain.c_str(), "NT Authority") == 0;
     this_machine = domain.empty() || domain == "." || nt_authority;
     // The built-in service accounts of the other system map to local ones.
