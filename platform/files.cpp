@@ -1,11 +1,10 @@
 // What both systems do the same way, through the C library and
-// Boost.Filesystem: the PID file, paths, and the search for programs.
+// Boost.Filesystem: the PID file and paths.
 #include "platform/platform.hpp"
 
 #include <cstdio>
 
 #include <boost/filesystem/operations.hpp>
-#include <boost/process/search_path.hpp>
 
 namespace torvad::platform {
 
@@ -33,10 +32,6 @@ std::string absolute_path(const std::string& path, os_error& error) {
         return path;
     }
     return boost::filesystem::absolute(path, directory).lexically_normal().string();
-}
-
-std::string search_path(const std::string& name) {
-    return boost::process::search_path(name).string();
 }
 
 bool path_exists(const std::string& path) {

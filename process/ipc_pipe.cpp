@@ -9,9 +9,14 @@
 namespace torvad {
 
 platform::os_error process::create_ipc_pipe(platform::owned_handle& theirs) {
-    platform::os_error error = platform::make_ipc_pipe(ipc_pipe, theirs);
+    platform::pipe_step failed = platform::pipe_step::none;
+    platform::os_error error = platform::make_ipc_pipe(ipc_pipe, theirs, failed);
     if (!error)
         ipc_in = std::make_unique<framer>();
+    else if (failed == platform::pipe_step::open)
+        owner->log_error("failed to open ipc pipe.");
+    else
+        owner->log_error("failed to create ipc pipe.");
     return error;
 }
 

@@ -5,7 +5,6 @@
 #include <boost/filesystem/path.hpp>
 
 #include "daemon/daemon.hpp"
-#include "ipc/strings.hpp"
 
 namespace torvad {
 
@@ -31,15 +30,6 @@ platform::os_error resolve_executable(std::vector<std::string>& argv) {
     platform::os_error error;
     argv[0] = platform::absolute_path(argv[0], error);
     return error;
-}
-
-// The command line as Windows takes it: each element in double quotes, a
-// double quote in it behind a backslash, joined by blanks.
-std::string command_line_of(const std::vector<std::string>& argv) {
-    std::string line;
-    for (const auto& argument : argv)
-        line += (line.empty() ? "" : " ") + quote_argument(argument, "\"");
-    return line;
 }
 
 } // namespace
@@ -99,7 +89,6 @@ bool process::start() {
         argv.push_back(std::to_string(platform::handle_value(child_ipc.get())));
     }
     request.executable = argv[0];
-    request.command_line = command_line_of(argv);
     request.argv = std::move(argv);
     request.working_directory = working_directory;
     request.user = user;
@@ -115,6 +104,11 @@ bool process::start() {
         owner->log_warning("Failed to logon as user '%s': error %d", user.c_str(),
                            launched.error.code);
         return fail_launch(status_not_found, launched.error);
+    }
+    if (launched.failed_step == platform::launch_step::refused) {
+        owner->log_error("refused to run '%s': a command interpreter would read its arguments.",
+                         command[0].c_str());
+        return fail_launch(launched.error.code, launched.error);
     }
     if (launched.failed_step != platform::launch_step::none) {
         owner->log_error("failed to create child process.");
