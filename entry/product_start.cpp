@@ -22,7 +22,8 @@ constexpr std::size_t account_cap = 4096;
 // Runs scripts/init.ps1 through the interpreter on PATH, keeping the first
 // line of its output in account.
 platform::program_end run_init_script(first_line_reader& account) {
-    std::string interpreter = platform::search_path("powershell");
+    const std::vector<std::string>& wrapper = platform::script_wrapper();
+    std::string interpreter = platform::search_path(wrapper[0]);
     if (interpreter.empty())
         return {.error = platform::error_not_found};
     platform::os_error error;
@@ -30,11 +31,10 @@ platform::program_end run_init_script(first_line_reader& account) {
         boost::filesystem::path(platform::absolute_path(".", error)) / "scripts" / "init.ps1";
     if (error)
         return {.error = error.code};
+    std::vector<std::string> args(wrapper.begin() + 1, wrapper.end());
+    args.insert(args.end(), {script.string(), "."});
     return platform::run_program(
-        interpreter,
-        {"-noprofile", "-noninteractive", "-executionpolicy", "bypass", "-file", script.string(),
-         "."},
-        platform::returned_stream::output,
+        interpreter, args, platform::returned_stream::output,
         [&account](const char* data, std::size_t size) { account.feed(data, size); });
 }
 

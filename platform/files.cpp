@@ -1,11 +1,10 @@
 // What both systems do the same way, through the C library and
-// Boost.Filesystem: the PID file, paths, and the search for programs.
+// Boost.Filesystem: the PID file and paths.
 #include "platform/platform.hpp"
 
 #include <cstdio>
 
 #include <boost/filesystem/operations.hpp>
-#include <boost/process/search_path.hpp>
 
 namespace torvad::platform {
 
@@ -16,6 +15,28 @@ bool write_pid_file(const std::string& path, int pid) {
         return false;
     std::fprintf(file, "%d\n", pid);
     return std::fclose(file) == 0;
+}
+
+const std::vector<std::string>& script_wrapper() {
+    static const std::vector<std::string> wrapper = {
+        "powershell", "-noprofile", "-noninteractive", "-executionpolicy", "bypass", "-file"};
+    return wrapper;
+}
+
+os_error resolve_program(std::vector<std::string>& argv) {
+    std::string extension = boost::filesystem::path(argv[0]).extension().string();
+    if (extension.empty())
+        argv[0] += exe_suffix;
+    else if (extension == ".ps1")
+        argv.insert(argv.begin(), script_wrapper().begin(), script_wrapper().end());
+    if (argv[0].find_first_of("/\\") == std::string::npos) {
+        argv[0] = search_path(argv[0]);
+        if (argv[0].empty())
+            return {error_not_found, "search PATH"};
+    }
+    os_error error;
+    argv[0] = absolute_path(argv[0], error);
+    return error;
 }
 
 account_name split_account(const std::string& user) {
@@ -40,10 +61,6 @@ std::string absolute_path(const std::string& path, os_error& error) {
         return path;
     }
     return boost::filesystem::absolute(path, directory).lexically_normal().string();
-}
-
-std::string search_path(const std::string& name) {
-    return boost::process::search_path(name).string();
 }
 
 bool path_exists(const std::string& path) {

@@ -67,6 +67,13 @@ std::string absolute_path(const std::string& path, os_error& error);
 // The path of an executable found on PATH (with the extensions of PATHEXT on
 // Windows), or empty.
 std::string search_path(const std::string& name);
+// The program a command names, as it is launched: the executable suffix
+// added to a name without an extension, a ".ps1" script put behind its
+// interpreter (script_wrapper), and argv[0] made absolute, a bare name found
+// on PATH. An error when it is not found or the current directory is gone.
+os_error resolve_program(std::vector<std::string>& argv);
+// The interpreter of ".ps1" scripts and its flags, the script's path to follow.
+const std::vector<std::string>& script_wrapper();
 // The whole content of a file.
 os_error read_file(const std::string& path, std::string& content);
 // True when something of any type stands at path (a directory counts too).
@@ -91,9 +98,13 @@ void write_event_record(event_type type, const char* text);
 
 // --- pipes ----------------------------------------------------------------------
 
+// Which half of the ipc pipe could not be had: ours, made first, or the
+// child's end, opened on it.
+enum class pipe_step { none, create, open };
 // The duplex pipe of a persistent child: ours bound to the loop, theirs to be
-// inherited by the child, whose last argument names it.
-os_error make_ipc_pipe(stream& ours, owned_handle& theirs);
+// inherited by the child, whose last argument names it. On failure failed
+// says which half it was.
+os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed);
 // A relayed standard stream: for stdin (stream 0) the child reads theirs and
 // we write ours; for stdout and stderr (1, 2) the other way round.
 os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs);
@@ -118,8 +129,7 @@ enum class stdio_source { inherit, handles, none };
 
 struct launch_request {
     std::string executable;        // absolute path
-    std::vector<std::string> argv; // argv[0] included
-    std::string command_line;      // argv quoted and joined, as Windows takes it
+    std::vector<std::string> argv; // argv[0] included; each reaches the child as it is
     std::string working_directory; // empty: ours
     std::string user;              // "domain\name" to run as; empty: our own account
     stdio_source stdio = stdio_source::inherit;
@@ -129,8 +139,10 @@ struct launch_request {
     bool own_process_group = false;               // keeps a terminal's signals from the child
 };
 
-// Where a launch failed: the logon to the account, or making the child.
-enum class launch_step { none, logon, create };
+// Where a launch failed: the logon to the account, or making the child; or
+// the program was refused, being one whose arguments a command interpreter
+// would read (a batch file on Windows).
+enum class launch_step { none, logon, create, refused };
 
 struct launch_result {
     int pid = 0;
@@ -139,11 +151,11 @@ struct launch_result {
     os_error error;
 };
 
-// Launches the child. On Linux it keeps exactly fds 0, 1, 2 and the ipc end,
-// starts with default signal dispositions, an empty mask and the environment
-// without the service manager's socket; on Windows it inherits what handle
-// inheritance gives it. Any failure before the child runs is known (step, call
-// and code) when this returns.
+// Launches the child with exactly the items of argv as its arguments. It keeps
+// exactly its standard streams and the ipc end (fds 0, 1, 2 on Linux, which
+// also starts it with default signal dispositions, an empty mask and the
+// environment without the service manager's socket). Any failure before the
+// child runs is known (step, call and code) when this returns.
 launch_result launch_child(const launch_request& request);
 
 // Binds the process handle of a launch to watch; on failure it stays in process.

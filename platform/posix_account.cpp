@@ -1,7 +1,7 @@
 // Accounts on Linux: the other system's names mapped to local ones, and an
 // account resolved with its groups before a launch.
-#include "platform/posix_children.hpp"
 #include "platform/platform.hpp"
+#include "platform/posix_children.hpp"
 
 #include <cerrno>
 #include <grp.h>

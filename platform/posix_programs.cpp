@@ -10,6 +10,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <boost/process/search_path.hpp>
+
 #include "platform/posix_children.hpp"
 
 namespace torvad::platform {
@@ -88,6 +90,10 @@ program_end run_program(const std::string& path, const std::vector<std::string>&
     if (source.valid())
         relay_until_end(source.get(), launched.process.get(), on_output);
     return {0, wait_for_exit_code(launched.process.get())};
+}
+
+std::string search_path(const std::string& name) {
+    return boost::process::search_path(name).string();
 }
 
 } // namespace torvad::platform

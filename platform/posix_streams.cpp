@@ -30,7 +30,9 @@ os_error bind(stream& ours, owned_handle& handle) {
 
 } // namespace
 
-os_error make_ipc_pipe(stream& ours, owned_handle& theirs) {
+// Both ends come from one call, so only their making can fail.
+os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed) {
+    failed = pipe_step::create;
     int ends[2];
     if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) == -1)
         return {errno, "socketpair"};
@@ -40,6 +42,7 @@ os_error make_ipc_pipe(stream& ours, owned_handle& theirs) {
         theirs.reset();
         return error;
     }
+    failed = pipe_step::none;
     return {};
 }
 

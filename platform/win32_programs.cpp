@@ -2,11 +2,15 @@
 // run with Boost.Process as the product's start has always run them: the
 // program's path and its arguments on the command line, each quoted where it
 // holds a blank or a double quote.
+#include <windows.h>
+
+#include <boost/filesystem/operations.hpp>
 #include <boost/process/args.hpp>
 #include <boost/process/child.hpp>
 #include <boost/process/exe.hpp>
 #include <boost/process/io.hpp>
 #include <boost/process/pipe.hpp>
+#include <boost/process/search_path.hpp>
 
 #include "platform/platform.hpp"
 
@@ -44,6 +48,20 @@ program_end run_program(const std::string& path, const std::vector<std::string>&
     } catch (const bp::process_error& failure) {
         return {failure.code().value() != 0 ? failure.code().value() : -1};
     }
+}
+
+// Boost's search reads PATHEXT without asking whether it is there at all;
+// without it only the name itself is looked for, in each folder of PATH.
+std::string search_path(const std::string& name) {
+    if (GetEnvironmentVariableA("PATHEXT", nullptr, 0) != 0)
+        return boost::process::search_path(name).string();
+    for (const auto& folder : boost::this_process::path()) {
+        boost::system::error_code error;
+        auto candidate = folder / name;
+        if (boost::filesystem::is_regular_file(candidate, error))
+            return candidate.string();
+    }
+    return {};
 }
 
 } // namespace torvad::platform

@@ -3,7 +3,10 @@
 // stream's own buffer.
 #include <windows.h>
 
+#include <sddl.h>
+
 #include <algorithm>
+#include <memory>
 
 #include <boost/asio/buffer.hpp>
 #include <boost/asio/error.hpp>
@@ -27,64 +30,127 @@ os_error last_error(const char* call) {
     return {static_cast<int>(GetLastError()), call};
 }
 
+// A descriptor whose one list admits our own account and the system, and
+// nobody else: "D:P" protects it from inherited entries, GA is all access.
+os_error own_account_only(std::shared_ptr<void>& descriptor) {
+    HANDLE token = nullptr;
+    if (!OpenProcessToken(GetCurrentProcess(), TOKEN_QUERY, &token))
+        return last_error("OpenProcessToken");
+    owned_handle token_owner(token);
+    DWORD size = 0;
+    GetTokenInformation(token, TokenUser, nullptr, 0, &size);
+    if (size == 0)
+        return last_error("GetTokenInformation");
+    std::unique_ptr<char[]> user(new char[size]);
+    if (!GetTokenInformation(token, TokenUser, user.get(), size, &size))
+        return last_error("GetTokenInformation");
+    char* sid_text = nullptr;
+    if (!ConvertSidToStringSidA(reinterpret_cast<TOKEN_USER*>(user.get())->User.Sid, &sid_text))
+        return last_error("ConvertSidToStringSidA");
+    std::string sddl = std::string("D:P(A;;GA;;;SY)(A;;GA;;;") + sid_text + ")";
+    LocalFree(sid_text);
+    PSECURITY_DESCRIPTOR made = nullptr;
+    if (!ConvertStringSecurityDescriptorToSecurityDescriptorA(sddl.c_str(), SDDL_REVISION_1, &made,
+                                                              nullptr))
+        return last_error("ConvertStringSecurityDescriptorToSecurityDescriptorA");
+    descriptor.reset(made, LocalFree);
+    return {};
+}
+
 // Binds handle to ours; on failure it stays in handle.
 os_error bind(stream& ours, owned_handle& handle) {
     return adopt_handle(ours, handle);
 }
 
-} // namespace
+const char* const name_taken = "CreateNamedPipeA, its name taken by another program";
 
-os_error make_ipc_pipe(stream& ours, owned_handle& theirs) {
-    std::string name = pipe_name("", ipc_pipe_counter++);
-    HANDLE made = CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
-                                   PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE | PIPE_WAIT, 1, 8192,
-                                   8192, 0, nullptr);
+// One instance of the pipe name, ours bound to the loop, theirs opened on it,
+// which connects the pipe. The names can be guessed, so each pipe is made
+// ours alone rather than left open to any local user: a name somebody took
+// first fails, only our own account and the system, on this machine, may
+// connect, and the server may identify the opener but never act as it.
+// Theirs is not inheritable: the launch that hands it on makes it so. Where
+// the ends may read (duplex), the instances and the server are checked too:
+// the check needs that access.
+os_error make_pipe(const std::string& name, DWORD open_mode, DWORD pipe_mode, DWORD buffer_size,
+                   stream& ours, DWORD their_access, DWORD their_flags, owned_handle& theirs,
+                   pipe_step& failed, bool duplex) {
+    failed = pipe_step::create;
+    std::shared_ptr<void> descriptor;
+    if (os_error error = own_account_only(descriptor))
+        return error;
+    SECURITY_ATTRIBUTES ours_alone{sizeof ours_alone, descriptor.get(), FALSE};
+    HANDLE made = CreateNamedPipeA(name.c_str(), open_mode | FILE_FLAG_FIRST_PIPE_INSTANCE,
+                                   pipe_mode | PIPE_WAIT | PIPE_REJECT_REMOTE_CLIENTS, 1,
+                                   buffer_size, buffer_size, 0, &ours_alone);
+    if (made == INVALID_HANDLE_VALUE && GetLastError() == ERROR_ACCESS_DENIED)
+        return {ERROR_ACCESS_DENIED, name_taken};
     if (made == INVALID_HANDLE_VALUE)
         return last_error("CreateNamedPipeA");
     owned_handle server(made);
+    // Where the first-instance flag is not enforced (Wine), ours may have
+    // joined the instances of somebody else's pipe, and the open below could
+    // connect to one of theirs.
+    DWORD instances = 1;
+    if (duplex &&
+        !GetNamedPipeHandleStateA(made, nullptr, &instances, nullptr, nullptr, nullptr, 0))
+        return last_error("GetNamedPipeHandleStateA");
+    if (instances != 1)
+        return {ERROR_ACCESS_DENIED, name_taken};
     if (os_error error = bind(ours, server))
         return error;
-    // Opening the other end connects the pipe; the child inherits this handle.
-    SECURITY_ATTRIBUTES inheritable{sizeof inheritable, nullptr, TRUE};
-    HANDLE client = CreateFileA(name.c_str(), GENERIC_READ | GENERIC_WRITE, 0, &inheritable,
-                                OPEN_EXISTING, FILE_FLAG_OVERLAPPED, nullptr);
+    failed = pipe_step::open;
+    HANDLE client =
+        CreateFileA(name.c_str(), their_access, 0, nullptr, OPEN_EXISTING,
+                    their_flags | SECURITY_SQOS_PRESENT | SECURITY_IDENTIFICATION, nullptr);
     if (client == INVALID_HANDLE_VALUE)
         return last_error("CreateFileA");
-    theirs.reset(client);
+    owned_handle opened(client);
+    ULONG server_id = GetCurrentProcessId();
+    if (duplex && !GetNamedPipeServerProcessId(client, &server_id))
+        return last_error("GetNamedPipeServerProcessId");
+    if (server_id != GetCurrentProcessId())
+        return {ERROR_ACCESS_DENIED, "CreateFileA, connected to another program's pipe"};
+    theirs = std::move(opened);
+    failed = pipe_step::none;
     return {};
 }
 
+} // namespace
+
+os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed) {
+    std::string name = pipe_name("", ipc_pipe_counter++);
+    return make_pipe(name, PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
+                     PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE, 8192, ours,
+                     GENERIC_READ | GENERIC_WRITE, FILE_FLAG_OVERLAPPED, theirs, failed, true);
+}
+
 // Our end overlapped for the loop; the child's end plain, as a program's
-// standard handles are, and made inheritable only at its launch.
+// standard handles are.
 os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) {
     bool child_reads = stream_number == 0;
     std::string name = pipe_name("stdio_", relay_pipe_counter++);
     DWORD direction = child_reads ? PIPE_ACCESS_OUTBOUND : PIPE_ACCESS_INBOUND;
-    HANDLE made = CreateNamedPipeA(name.c_str(), direction | FILE_FLAG_OVERLAPPED,
-                                   PIPE_TYPE_BYTE | PIPE_READMODE_BYTE | PIPE_WAIT, 1, 65536, 65536,
-                                   0, nullptr);
-    if (made == INVALID_HANDLE_VALUE)
-        return last_error("CreateNamedPipeA");
-    owned_handle server(made);
-    if (os_error error = bind(ours, server))
-        return error;
-    HANDLE client = CreateFileA(name.c_str(), child_reads ? GENERIC_READ : GENERIC_WRITE, 0,
-                                nullptr, OPEN_EXISTING, 0, nullptr);
-    if (client == INVALID_HANDLE_VALUE) {
-        os_error error = last_error("CreateFileA");
-        boost::system::error_code ignored;
+    pipe_step failed = pipe_step::none;
+    os_error error = make_pipe(
+        name, direction | FILE_FLAG_OVERLAPPED, PIPE_TYPE_BYTE | PIPE_READMODE_BYTE, 65536, ours,
+        child_reads ? GENERIC_READ : GENERIC_WRITE, 0, theirs, failed, false);
+    boost::system::error_code ignored;
+    if (failed == pipe_step::open)
         ours.close(ignored);
-        return error;
-    }
-    theirs.reset(client);
-    return {};
+    return error;
 }
 
 os_error attach_pipe(stream& ours, std::int64_t value) {
     // -1 would name this process itself, and 0 no handle at all.
     if (value <= 0)
         return {ERROR_INVALID_HANDLE, "attach"};
-    owned_handle given(reinterpret_cast<HANDLE>(static_cast<std::intptr_t>(value)));
+    HANDLE handle = reinterpret_cast<HANDLE>(static_cast<std::intptr_t>(value));
+    // It came to us by inheritance; left so, it would pass on to every
+    // program that the peer has us run.
+    if (!SetHandleInformation(handle, HANDLE_FLAG_INHERIT, 0))
+        return last_error("SetHandleInformation");
+    owned_handle given(handle);
     os_error error = bind(ours, given);
     // A handle that was given to us stays open, whatever we could do with it.
     given.release();

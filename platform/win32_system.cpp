@@ -2,6 +2,7 @@
 // Windows.
 #include <windows.h>
 
+#include <csignal>
 #include <direct.h>
 #include <exception>
 #include <fcntl.h>
@@ -27,9 +28,32 @@ std::string describe(const os_error& error) {
     return std::string(error.call) + ": " + reason;
 }
 
+namespace {
+
+// The runtime turns the console's Ctrl-C into SIGINT, which the loop waits
+// for; Ctrl-Break and the closing of the console would end us at once,
+// without a sigterm to any child and with the PID file left behind. They are
+// made the same SIGINT. The close ends us when this returns, so it waits
+// here, within the few seconds Windows grants, while the loop stops the
+// children and the program returns.
+BOOL WINAPI stop_on_console_event(DWORD event) {
+    if (event != CTRL_BREAK_EVENT && event != CTRL_CLOSE_EVENT)
+        return FALSE;
+    std::raise(SIGINT);
+    if (event == CTRL_CLOSE_EVENT)
+        Sleep(INFINITE);
+    return TRUE;
+}
+
+} // namespace
+
 // Windows starts us as we are: standard handles that are missing stay null,
-// and a child's end is seen on its process handle, not by a signal.
-void prepare_own_process() {}
+// and a child's end is seen on its process handle, not by a signal. Whichever
+// console handler is asked first, the runtime's takes Ctrl-C alone. Without
+// ours (there is no log yet to say so), those events end us as before.
+void prepare_own_process() {
+    SetConsoleCtrlHandler(stop_on_console_event, TRUE);
+}
 
 void unbuffer_output() {
     // The runtime knows no line buffering, so nothing is buffered; and a line

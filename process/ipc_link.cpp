@@ -5,8 +5,8 @@
 
 namespace torvad {
 
-platform::os_error ipc_link::make(platform::owned_handle& theirs) {
-    platform::os_error error = platform::make_ipc_pipe(pipe_, theirs);
+platform::os_error ipc_link::make(platform::owned_handle& theirs, platform::pipe_step& failed) {
+    platform::os_error error = platform::make_ipc_pipe(pipe_, theirs, failed);
     if (!error)
         in_ = std::make_unique<framer>();
     return error;

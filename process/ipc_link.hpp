@@ -24,7 +24,7 @@ class ipc_link {
     explicit ipc_link(boost::asio::io_context& loop) : pipe_(loop) {}
 
     // A new pipe, theirs for the child; or one another program made.
-    platform::os_error make(platform::owned_handle& theirs);
+    platform::os_error make(platform::owned_handle& theirs, platform::pipe_step& failed);
     platform::os_error attach(std::int64_t handle_value);
     bool open() const { return pipe_.is_open(); }
     // Ends the pending read and write before the queue goes; channels are forgotten.
@@ -37,7 +37,8 @@ class ipc_link {
     }
     template <class OnPacket, class OnBadLength>
     void take(std::size_t bytes, OnPacket&& on_packet, OnBadLength&& on_bad_length) {
-        in_->add(bytes, std::forward<OnPacket>(on_packet), std::forward<OnBadLength>(on_bad_length));
+        in_->add(bytes, std::forward<OnPacket>(on_packet),
+                 std::forward<OnBadLength>(on_bad_length));
     }
     // A channel that doesn't read its stdin holds back the pipe that feeds it:
     // reads pause after each one and go on only while no channel is over its mark.
@@ -56,14 +57,14 @@ class ipc_link {
         if (out_.empty() || !pipe_.is_open())
             return;
         writing_ = true;
-        pipe_.async_write_some(out_.front(), [this, written = std::forward<Written>(written)](
-                                                 const boost::system::error_code& error,
-                                                 std::size_t bytes) {
-            if (error)
-                return;
-            out_.consume(bytes);
-            written();
-        });
+        pipe_.async_write_some(out_.front(),
+                               [this, written = std::forward<Written>(written)](
+                                   const boost::system::error_code& error, std::size_t bytes) {
+                                   if (error)
+                                       return;
+                                   out_.consume(bytes);
+                                   written();
+                               });
     }
     bool backlogged() const { return out_.size() >= ipc_high_mark; }
     // Channels whose output waits for room in the queue; once below the low

@@ -2,46 +2,7 @@
 // make its pipes, switch account, launch, then watch its exit and streams.
 #include "process/process.hpp"
 
-#include <boost/filesystem/path.hpp>
-
-#include "ipc/strings.hpp"
-
 namespace torvad {
-
-namespace {
-
-const char* const script_wrapper[] = {"powershell",       "-noprofile", "-noninteractive",
-                                      "-executionpolicy", "bypass",     "-file"};
-
-// Applies the suffix and script rules to argv[0] and makes it absolute; an
-// error when a bare name is not on the search path or the current directory
-// is gone.
-platform::os_error resolve_executable(std::vector<std::string>& argv) {
-    std::string extension = boost::filesystem::path(argv[0]).extension().string();
-    if (extension.empty())
-        argv[0] += platform::exe_suffix;
-    else if (extension == ".ps1")
-        argv.insert(argv.begin(), std::begin(script_wrapper), std::end(script_wrapper));
-    if (argv[0].find_first_of("/\\") == std::string::npos) {
-        argv[0] = platform::search_path(argv[0]);
-        if (argv[0].empty())
-            return {platform::error_not_found, "search PATH"};
-    }
-    platform::os_error error;
-    argv[0] = platform::absolute_path(argv[0], error);
-    return error;
-}
-
-// The command line as Windows takes it: each element in double quotes, a
-// double quote in it behind a backslash, joined by blanks.
-std::string command_line_of(const std::vector<std::string>& argv) {
-    std::string line;
-    for (const auto& argument : argv)
-        line += (line.empty() ? "" : " ") + quote_argument(argument, "\"");
-    return line;
-}
-
-} // namespace
 
 bool process::fail_launch(std::uint32_t failure_status, const platform::os_error& error) {
     if (error)
@@ -77,7 +38,7 @@ bool process::start() {
         return fail_launch(status_malformed, {});
     }
     std::vector<std::string> argv = command;
-    if (platform::os_error error = resolve_executable(argv)) {
+    if (platform::os_error error = platform::resolve_program(argv)) {
         owner.log_error("executable '%s' not found.", command[0].c_str());
         return fail_launch(status_not_found, error);
     }
@@ -87,7 +48,11 @@ bool process::start() {
     if (!prepare_stdio(request, child_stdio))
         return false;
     if (persistent) {
-        if (platform::os_error error = link_.make(child_ipc)) {
+        platform::pipe_step failed = platform::pipe_step::none;
+        if (platform::os_error error = link_.make(child_ipc, failed)) {
+            // The half that failed says its own line, and the launch the usual one.
+            owner.log_error(failed == platform::pipe_step::open ? "failed to open ipc pipe."
+                                                                : "failed to create ipc pipe.");
             owner.log_error("failed to create ipc pipe.");
             return fail_launch(error.code, error);
         }
@@ -95,7 +60,6 @@ bool process::start() {
         argv.push_back(std::to_string(platform::handle_value(child_ipc.get())));
     }
     request.executable = argv[0];
-    request.command_line = command_line_of(argv);
     request.argv = std::move(argv);
     request.working_directory = working_directory;
     request.user = user;
@@ -111,6 +75,11 @@ bool process::start() {
         owner.log_warning("Failed to logon as user '%s': error %d", user.c_str(),
                           launched.error.code);
         return fail_launch(status_not_found, launched.error);
+    }
+    if (launched.failed_step == platform::launch_step::refused) {
+        owner.log_error("refused to run '%s': a command interpreter would read its arguments.",
+                        command[0].c_str());
+        return fail_launch(launched.error.code, launched.error);
     }
     if (launched.failed_step != platform::launch_step::none) {
         owner.log_error("failed to create child process.");

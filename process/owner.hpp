@@ -19,7 +19,7 @@ class process;
 
 // What a process reads of the run it belongs to, as it is at the time.
 struct run_facts {
-    std::string program_name; // for the version packet
+    std::string program_name;  // for the version packet
     bool verbose = false;      // -v: the packet trace and log_verbose lines
     bool background = false;   // the service path: no console, no process groups
     bool trace_colour = false; // the trace may colour its text

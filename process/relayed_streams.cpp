@@ -6,7 +6,8 @@ namespace torvad {
 platform::os_error relayed_streams::make(platform::owned_handle (&theirs)[3]) {
     platform::stream* ours[3] = {&stdin_, &stdout_, &stderr_};
     for (int stream = 0; stream < 3; ++stream)
-        if (platform::os_error error = platform::make_relay_pipe(stream, *ours[stream], theirs[stream]))
+        if (platform::os_error error =
+                platform::make_relay_pipe(stream, *ours[stream], theirs[stream]))
             return error;
     return {};
 }

@@ -62,19 +62,20 @@ class relayed_streams {
             return;
         }
         writing_ = true;
-        stdin_.async_write_some(
-            stdin_queue_.front(), [this, written = std::forward<Written>(written)](
-                                      const boost::system::error_code& error, std::size_t n) {
-                if (error == boost::asio::error::operation_aborted)
-                    return;
-                // Any other failure is the child's end gone: nothing more goes in.
-                if (error) {
-                    close_input();
-                    stdin_queue_.clear();
-                }
-                stdin_queue_.consume(n);
-                written();
-            });
+        stdin_.async_write_some(stdin_queue_.front(),
+                                [this, written = std::forward<Written>(written)](
+                                    const boost::system::error_code& error, std::size_t n) {
+                                    if (error == boost::asio::error::operation_aborted)
+                                        return;
+                                    // Any other failure is the child's end gone: nothing more goes
+                                    // in.
+                                    if (error) {
+                                        close_input();
+                                        stdin_queue_.clear();
+                                    }
+                                    stdin_queue_.consume(n);
+                                    written();
+                                });
     }
     // What the child was owed is dropped with the child.
     void clear_input() {

@@ -22,6 +22,14 @@ std::vector<std::string> start_state(int ipc_fd);
 // adopted it and ends when we do. False when that can't be done (on Windows
 // nothing adopts a process).
 bool leave_orphans(int count);
+// Takes, first, the name that the parent's ipc pipe number n would get, with
+// room for any number of instances, as another program of the machine could;
+// false where pipes have no names (Linux).
+bool take_pipe_name(int n);
+// Console control event n (1 Ctrl-Break, 2 close) to our parent, as the
+// console delivers one: a thread of the parent's own runs its handlers.
+// False where there are no such events (Linux) or it can't be sent.
+bool console_event(int n);
 // Named for a tool of the system that the tests run (Windows: powershell,
 // schtasks, sleep), the child stands in for it and gives its exit code; -1
 // when the name is no such tool's (on Linux shell scripts and the system's

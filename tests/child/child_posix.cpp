@@ -112,4 +112,12 @@ int stand_in_for_tool(const char*) {
     return -1;
 }
 
+bool take_pipe_name(int) {
+    return false;
+}
+
+bool console_event(int) {
+    return false;
+}
+
 } // namespace child_host

@@ -1,5 +1,7 @@
 #include <windows.h>
 
+#include <tlhelp32.h>
+
 #include <cctype>
 #include <cstdlib>
 #include <fcntl.h>
@@ -13,10 +15,11 @@
 namespace child_host {
 
 namespace {
-// Ctrl-C at the console reaches every program on it; a peer ends by its
-// sigterm packet, as it does when torvad runs as a service.
+// Ctrl-Break at the console reaches every program on it, whatever its group
+// (Ctrl-C is off in the group of its own that torvad gives each child); a
+// peer ends by its sigterm packet, as it does when torvad runs as a service.
 BOOL WINAPI ignore_interrupt(DWORD event) {
-    return event == CTRL_C_EVENT || event == CTRL_BREAK_EVENT;
+    return event == CTRL_BREAK_EVENT;
 }
 } // namespace
 
@@ -63,6 +66,48 @@ std::vector<std::string> start_state(int) {
 
 bool leave_orphans(int) {
     return false;
+}
+
+namespace {
+
+DWORD parent_id() {
+    HANDLE all = CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0);
+    PROCESSENTRY32 entry{};
+    entry.dwSize = sizeof entry;
+    DWORD parent = 0;
+    for (BOOL more = Process32First(all, &entry); more; more = Process32Next(all, &entry))
+        if (entry.th32ProcessID == GetCurrentProcessId())
+            parent = entry.th32ParentProcessID;
+    CloseHandle(all);
+    return parent;
+}
+
+} // namespace
+
+bool take_pipe_name(int n) {
+    std::string name =
+        "\\\\.\\pipe\\torvad_" + std::to_string(parent_id()) + "_" + std::to_string(n);
+    // Left open until we end, as a squatter would hold it.
+    return CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX, PIPE_TYPE_BYTE,
+                            PIPE_UNLIMITED_INSTANCES, 4096, 4096, 0,
+                            nullptr) != INVALID_HANDLE_VALUE;
+}
+
+// GenerateConsoleCtrlEvent fails on Wine's terminal console, so the event
+// goes the way the console itself sends it: kernelbase's CtrlRoutine, which
+// lies at the same address in every process, run on a thread in the parent.
+bool console_event(int n) {
+    auto routine = reinterpret_cast<LPTHREAD_START_ROUTINE>(
+        reinterpret_cast<void*>(GetProcAddress(GetModuleHandleA("kernelbase"), "CtrlRoutine")));
+    HANDLE parent = OpenProcess(PROCESS_ALL_ACCESS, FALSE, parent_id());
+    HANDLE thread =
+        routine == nullptr || parent == nullptr
+            ? nullptr
+            : CreateRemoteThread(parent, nullptr, 0, routine,
+                                 reinterpret_cast<void*>(static_cast<INT_PTR>(n)), 0, nullptr);
+    if (parent != nullptr)
+        CloseHandle(parent);
+    return thread != nullptr && CloseHandle(thread);
 }
 
 namespace {

@@ -294,6 +294,30 @@ int mode_execute(const context& how) {
     return await_sigterm(link, true);
 }
 
+// Each argument in brackets, as the program got it; a byte that a console
+// would draw otherwise as \xHH.
+int mode_args(const context& how) {
+    std::string line;
+    char escaped[5];
+    for (const auto& arg : how.args) {
+        line += "[";
+        for (unsigned char c : arg)
+            line += c >= 0x20 && c < 0x7f ? std::string(1, static_cast<char>(c))
+                                          : (std::snprintf(escaped, sizeof escaped, "\\x%02x", c),
+                                             std::string(escaped));
+        line += "]";
+    }
+    say("args %s", line.c_str());
+    return 0;
+}
+
+// Takes the name of torvad's ipc pipe number N first, then sends the
+// requests behind N as the execute mode does.
+int mode_squat(const context& how) {
+    say("squat %s", child_host::take_pipe_name(how.number(0)) ? "taken" : "failed");
+    return mode_execute({how.self, {how.args.begin() + 1, how.args.end()}, how.ipc_fd});
+}
+
 // Writes MiB mebibytes to stdout, then creates the marker file.
 int mode_write(const context& how) {
     std::string block(1 << 20, 'w');
@@ -381,6 +405,12 @@ const mode modes[] = {
     {"flood-out", mode_flood_out},
     {"flood-in", mode_flood_in},
     {"orphans", mode_orphans},
+    {"args", mode_args},
+    {"squat", mode_squat},
+    {"console-event",
+     [](const context& how) {
+         return child_host::console_event(how.number(0)) ? serve(how, true) : 1;
+     }},
 };
 
 } // namespace

@@ -80,9 +80,37 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "!INT", "=0"},
          {.ignore_sigchld = true},
          systems::linux_only},
-        // Ctrl-C reaches the terminal's whole group; the child ends by sigterm
+        // Ctrl-C reaches the terminal's whole group; the child ends by sigterm, not by it
         {{"--", child_binary, "peer"},
-         {"?child: ready", "!GROUP", "?child: sigterm", "?'test_child' exited with 0x0.", "=0"}},
+         {"?child: ready", "!GROUP", "?child: sigterm", "?'test_child' exited with 0x0.", "=0",
+          "-again"}},
+        // Ctrl-Break and the console's close stop the children the same way
+        {{"--", child_binary, "console-event", "1"},
+         {"?stopping torvad", "?child: sigterm", "?'test_child' exited with 0x0.", "=0", "-again"},
+         {},
+         systems::windows_only},
+        {{"--", child_binary, "console-event", "2"},
+         {"?stopping torvad", "?child: sigterm", "?'test_child' exited with 0x0.", "=0"},
+         {},
+         systems::windows_only},
+        // each item reaches the program whole: none of it can become an argument of its own
+        {requests({pipes, child_binary, "args", "a\\\" --delete-all", "C:\\dir\\", "x y",
+                   "\\\\\"q\\", "", "t\tab", "\"", "\\", "\xc3\xa9\xe2\x82\xac", "end"}),
+         {"?child: 1 stdout child: args [a\\\" --delete-all][C:\\dir\\][x y][\\\\\"q\\][]"
+          "[t\\x09ab][\"][\\][\\xc3\\xa9\\xe2\\x82\\xac][end]\n",
+          "!INT", "=0"}},
+        // a batch file would have cmd.exe read its arguments: refused, by any spelling
+        {requests({"0", missing + ".bat", "+", "0", missing + ".CmD. "}),
+         {"?refused to run '", "?child: 1 failed 193", "?child: 2 failed 193", "!INT", "=0"},
+         {},
+         systems::windows_only},
+        // a pipe name taken before torvad makes it fails the launch; nothing reaches the taker
+        {{"-v", "--", child_binary, "squat", "1", "1", child_binary, "peer"},
+         {"?child: squat taken", "?failed to create ipc pipe.", "?failed to create ipc pipe.",
+          "?its name taken by another program", "?child: 1 failed 5", "!INT", "=0",
+          "-child: 1 opened"},
+         {},
+         systems::windows_only},
     };
     for (const auto& r : rows) {
         if (!holds_here(r.where))
