@@ -69,6 +69,7 @@ image: build container-deps
 	  build/image-root
 	rm -f build/torvad-image.tar
 	$(IMAGE_PODMAN) save -q --format oci-archive -o build/torvad-image.tar localhost/torvad:$(VERSION)
+	$(IMAGE_PODMAN) image prune -f >/dev/null
 
 # The image under podman with runc, and the Kubernetes manifest through
 # `podman kube play`, on a storage folder of the test's own. About a minute.

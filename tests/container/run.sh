@@ -9,6 +9,8 @@ archive=$(realpath "$1") manifest=$(realpath "$2")
 here=$(dirname "$(realpath "$0")")
 store=$(mktemp -d /tmp/torvad-container.XXXXXX)
 touch "$store/started"
+cgroups=/sys/fs/cgroup/pids/libpod_parent
+[ -e "$cgroups" ] && cgroups= # podman's, if it made them: they go at the end
 passed=0 failed=0
 podman_sh=$here/../../packaging/container/podman.sh
 p() { "$podman_sh" "$store" "$@"; }
@@ -38,6 +40,12 @@ cleanup() {
     p rm -af -t 0 >/dev/null 2>&1
     p system reset -f >/dev/null 2>&1
     rm -rf "$store"
+    tidy_cgroups
+}
+tidy_cgroups() {
+    [ -n "$cgroups" ] && for tree in /sys/fs/cgroup/*/libpod_parent; do
+        find "$tree" -depth -type d -exec rmdir {} \; 2>/dev/null
+    done
 }
 trap cleanup EXIT
 now_ms() { echo $(($(date +%s%N) / 1000000)); }
@@ -47,7 +55,11 @@ cores() { p top "$1" pid comm | awk '$2 == "core" { print $1 }'; }
 one_core() { [ "$(cores "$1" | wc -l)" = 1 ]; }
 refusals() { [ "$(p logs "${2:-demo}" 2>&1 | grep -c 'refused with status 13')" = "$1" ]; }
 as_nobody() { p top "$1" user comm | awk 'NR > 1 && $1 != "nobody" { bad = 1 } $2 == "core" { core = 1 } END { exit bad || !core }'; }
-untouched() { [ -z "$(find /var/lib/containers /run/containers /run/libpod /etc/containers /etc/cni -newer "$store/started" 2>/dev/null)" ]; }
+untouched() {
+    tidy_cgroups
+    [ -z "$(find /var/lib/containers /run/containers /run/libpod /etc/containers /etc/cni \
+        /sys/fs/cgroup/*/libpod_parent -newer "$store/started" 2>/dev/null)" ]
+}
 after_a_second() { sleep 1 && "$@"; }
 one_new_core() { one_core demo && [ "$(cores demo)" != "$1" ]; }
 orphans_with_torvad() { p top demo ppid comm | grep -q '^1 *busybox'; }
@@ -133,6 +145,6 @@ p rm -f demo empty closed >/dev/null 2>&1
 check "no container and no pod is left" test -z "$(p ps -aq)$(p pod ps -q)"
 p rmi -af >/dev/null 2>&1
 check "no image is left" test -z "$(p images -aq)"
-check "the machine's own podman store is as it was" untouched
+check "the machine's own podman store and cgroups are as they were" untouched
 echo "$passed passed, $failed failed"
 [ "$failed" -eq 0 ]
