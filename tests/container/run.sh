@@ -125,7 +125,8 @@ check "unreadable exec.patterns: the stop is still orderly" ordered_stop closed
 # alone kills at once, so the pod is stopped first.)
 grace=$(sed -n 's/^ *terminationGracePeriodSeconds: *\([0-9]*\).*/\1/p' "$manifest")
 check "kube play runs the manifest unchanged" p kube play "$manifest"
-pod=$(p pod ps -q) ctr=$(p ps --format '{{.Names}}' | grep -v -- -infra)
+pod=$(p pod ps -q)
+ctr=$(p ps --filter "pod=$pod" --format '{{.Names}}' | grep -v -- -infra)
 check "kube: core runs, relayed as before" within 10 logs_have "$ctr" "core: 'uname -sr' says: Linux"
 check "kube: torvad and core run as nobody" as_nobody "$ctr"
 check "kube: on a read-only root" test "$(p inspect -f '{{.HostConfig.ReadonlyRootfs}}' "$ctr")" = true
