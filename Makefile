@@ -5,7 +5,7 @@ PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
 FUZZ_SECONDS ?= 30
 
 .PHONY: all deps build run package test test-asan test-system fuzz bench format format-check clean \
-        windows windows-deps test-windows
+        windows windows-deps test-windows container-deps image test-container
 
 all: build
 
@@ -41,6 +41,7 @@ test: build
 	$(MAKE) fuzz
 	$(MAKE) test-system
 	$(MAKE) test-windows
+	$(MAKE) test-container
 	ctest --test-dir build --output-on-failure -j2
 
 # The package on a real systemd, booted in namespaces of its own over a
@@ -50,6 +51,30 @@ test-system: package
 	@dpkg -s systemd util-linux >/dev/null 2>&1 || { apt-get update && \
 	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux; }
 	tests/system/run.sh build/torvad_$$(sed -n 's/^project(torvad VERSION \([^ ]*\).*/\1/p' CMakeLists.txt)_amd64.deb build/demo_core
+
+# --- The OCI image: torvad and the demo product, FROM scratch, offline -------
+CONTAINER_PACKAGES := podman runc conmon containernetworking-plugins catatonit busybox-static
+VERSION := $(shell sed -n 's/^set(CPACK_PACKAGE_VERSION \(.*\))/\1/p' CMakeLists.txt)
+# podman on the build's own storage: the machine's image store stays as it was.
+IMAGE_PODMAN := packaging/container/podman.sh build/containers
+
+container-deps:
+	@dpkg -s $(CONTAINER_PACKAGES) >/dev/null 2>&1 || { apt-get update && \
+	  DEBIAN_FRONTEND=noninteractive apt-get install -y $(CONTAINER_PACKAGES); }
+
+# build/torvad-image.tar, an OCI archive: `podman load -i` it, or copy it to a registry.
+image: build container-deps
+	packaging/container/stage.sh build build/image-root
+	$(IMAGE_PODMAN) build -q -f packaging/container/Containerfile -t localhost/torvad:$(VERSION) \
+	  build/image-root
+	rm -f build/torvad-image.tar
+	$(IMAGE_PODMAN) save -q --format oci-archive -o build/torvad-image.tar localhost/torvad:$(VERSION)
+	$(IMAGE_PODMAN) image prune -f >/dev/null
+
+# The image under podman with runc, and the Kubernetes manifest through
+# `podman kube play`, on a storage folder of the test's own. About a minute.
+test-container: image
+	tests/container/run.sh build/torvad-image.tar deploy/kubernetes/torvad.yaml
 
 build-asan/build.ninja:
 	cmake -S . -B build-asan -G Ninja -DCMAKE_BUILD_TYPE=Debug -DTORVAD_SANITIZE=ON

@@ -1,0 +1,145 @@
+#!/bin/sh
+# The image of `make image` under a real runtime: podman with runc, on a
+# storage folder of the test's own, and the Kubernetes manifest through
+# `podman kube play`. Ends with "N passed, N failed"; exit 1 on a failure, and
+# a podman that can't run the image is a failure. Leaves nothing behind.
+#   tests/container/run.sh build/torvad-image.tar deploy/kubernetes/torvad.yaml
+set -u
+archive=$(realpath "$1") manifest=$(realpath "$2")
+here=$(dirname "$(realpath "$0")")
+store=$(mktemp -d /tmp/torvad-container.XXXXXX)
+touch "$store/started"
+cgroups=/sys/fs/cgroup/pids/libpod_parent
+[ -e "$cgroups" ] && cgroups= # podman's, if it made them: they go at the end
+passed=0 failed=0
+podman_sh=$here/../../packaging/container/podman.sh
+p() { "$podman_sh" "$store" "$@"; }
+
+check() { # description, then a command that must succeed
+    what=$1 && shift
+    if "$@" >/dev/null 2>&1; then passed=$((passed + 1)) && echo "ok   $what"
+    else failed=$((failed + 1)) && echo "FAIL $what"; fi
+}
+within() { # seconds, then a command
+    limit=$(($(date +%s) + $1)) && shift
+    until "$@" >/dev/null 2>&1; do
+        [ "$(date +%s)" -lt "$limit" ] || return 1
+        sleep 0.2
+    done
+}
+cleanup() {
+    [ -n "${listener:-}" ] && kill "$listener" 2>/dev/null
+    p kube down "$manifest" >/dev/null 2>&1
+    p rm -af -t 0 >/dev/null 2>&1
+    p system reset -f >/dev/null 2>&1
+    rm -rf "$store"
+    tidy_cgroups
+}
+tidy_cgroups() {
+    [ -n "$cgroups" ] && for tree in /sys/fs/cgroup/*/libpod_parent; do
+        find "$tree" -depth -type d -exec rmdir {} \; 2>/dev/null
+    done
+}
+trap cleanup EXIT
+now_ms() { echo $(($(date +%s%N) / 1000000)); }
+logs_have() { p logs "$1" 2>&1 | grep -qF -- "$2"; }
+cores() { p top "$1" pid comm | awk '$2 == "core" { print $1 }'; }
+one_core() { [ "$(cores "$1" | wc -l)" = 1 ]; }
+refusals() { [ "$(p logs "${2:-demo}" 2>&1 | grep -c 'refused with status 13')" = "$1" ]; }
+as_nobody() { p top "$1" user comm | awk 'NR > 1 && $1 != "nobody" { bad = 1 } $2 == "core" { core = 1 } END { exit bad || !core }'; }
+untouched() {
+    tidy_cgroups
+    [ -z "$(find /var/lib/containers /run/containers /run/libpod /etc/containers /etc/cni \
+        /sys/fs/cgroup/*/libpod_parent -newer "$store/started" 2>/dev/null)" ]
+}
+one_new_core() { one_core demo && [ "$(cores demo)" != "$1" ]; }
+orphans_with_torvad() { p top demo ppid comm | grep -q '^1 *busybox'; }
+no_zombie_no_orphan() { ! p top demo state comm | grep -Eq '^Z|busybox'; }
+ordered_stop() { # container: what an orderly end through sigterm leaves
+    logs_have "$1" "stopping torvad version" && logs_have "$1" "core: asked to stop, ending cleanly" &&
+        logs_have "$1" "'core' exited with 0x0." && [ "$(p inspect -f '{{.State.ExitCode}}' "$1")" = 0 ]
+}
+
+image=$(tar -xOf "$archive" index.json | sed -n 's/.*"org.opencontainers.image.ref.name":"\([^"]*\)".*/\1/p')
+if ! p load -q -i "$archive" >/dev/null || ! p run --rm "$image" -h 2>&1 | grep -q "torvad version"; then
+    echo "FAIL podman loads and runs the image"
+    echo "0 passed, 1 failed"
+    exit 1
+fi
+check "podman loads and runs $image" true
+
+# READY=1 reaches the caller's NOTIFY_SOCKET only through torvad. At that
+# moment the listener notes each core's grandparent: conmon, for a core run by
+# the container's own first process.
+perl -MSocket -e 'socket(S, PF_UNIX, SOCK_DGRAM, 0) && bind(S, pack_sockaddr_un($ARGV[0])) || die;
+    sub proc { open(my $f, "/proc/$_[0]/$_[1]") or return ""; local $/; <$f> }
+    sub parent { (split / /, proc($_[0], "stat") =~ s/.*\) //sr)[1] }
+    $| = 1;
+    while (defined recv(S, $m, 4096, 0)) {
+        next unless $m =~ /^READY=1$/m;
+        @cores = grep { proc($_, "comm") eq "core\n" } map { s|/proc/||r } glob "/proc/[0-9]*";
+        print join(" ", "READY=1, cores under", map { parent(parent($_)) } @cores), " \n";
+    }' "$store/notify" >"$store/notify.log" &
+listener=$!
+within 5 test -S "$store/notify"
+# On a read-only root the demo's core can't leave its marker and doesn't fail
+# once: the core that READY=1 follows is the one that stays.
+NOTIFY_SOCKET=$store/notify p run -d --name ready --read-only --sdnotify=container "$image" >/dev/null
+conmon=$(p inspect -f '{{.State.ConmonPid}}' ready)
+check "sdnotify=container: READY=1 comes once core runs" within 10 grep -q "^READY=1.* $conmon " "$store/notify.log"
+p run -d --name demo "$image" >/dev/null
+check "podman logs show the demo's restart" within 10 logs_have demo "starting 'core' again."
+check "podman logs show a relayed output" within 10 logs_have demo "core: 'uname -sr' says: Linux"
+check "podman logs show the two refusals" within 10 refusals 2
+
+# Orphans of a burst come to torvad as PID 1, which reaps them all.
+p exec demo sh -c 'i=0; while [ $i -lt 50 ]; do sh -c "busybox sleep 2 &"; i=$((i + 1)); done'
+check "a burst of orphans goes to torvad" orphans_with_torvad
+check "no zombie is left after the burst" within 10 no_zombie_no_orphan
+
+old=$(cores demo)
+kill -9 "$(p top demo hpid comm | awk '$2 == "core" { print $1 }')"
+check "kill -9 of core: one new core" within 10 one_new_core "$old"
+sleep 1
+check "kill -9 of core: still one core a second later" one_core demo
+
+started=$(now_ms)
+p stop -t 10 demo >/dev/null
+took=$(($(now_ms) - started))
+check "podman stop: core ends through sigterm, exit 0" ordered_stop demo
+check "podman stop: well within the grace period ($took ms)" test "$took" -lt 5000
+
+# A broken image ends, or goes on closed, and says why: never a silent hang.
+timeout 30 "$podman_sh" "$store" run --name empty --tmpfs /opt/torvad:notmpcopyup "$image" >/dev/null 2>&1
+check "no core: the run ends by itself (exit $?)" logs_have empty "stopping torvad version"
+cp "$here/../../examples/demo/exec.patterns" "$store/patterns" && chmod 000 "$store/patterns"
+p run -d --name closed --cap-drop DAC_OVERRIDE,DAC_READ_SEARCH \
+    -v "$store/patterns:/opt/torvad/exec.patterns:ro" "$image" >/dev/null
+check "unreadable exec.patterns: said in the log" within 10 logs_have closed "failed to open patterns file 'exec.patterns'"
+check "unreadable exec.patterns: every request refused" within 10 refusals 3 closed
+p stop -t 10 closed >/dev/null
+check "unreadable exec.patterns: the stop is still orderly" ordered_stop closed
+
+# The manifest as a cluster takes it, stopped the way the kubelet stops a pod:
+# SIGTERM, and SIGKILL only after the grace period. (podman's `kube down`
+# alone kills at once, so the pod is stopped first.)
+grace=$(sed -n 's/^ *terminationGracePeriodSeconds: *\([0-9]*\).*/\1/p' "$manifest")
+check "kube play runs the manifest unchanged" p kube play "$manifest"
+pod=$(p pod ps -q)
+ctr=$(p ps --filter "pod=$pod" --format '{{.Names}}' | grep -v -- -infra)
+check "kube: core runs, relayed as before" within 10 logs_have "$ctr" "core: 'uname -sr' says: Linux"
+check "kube: torvad and core run as nobody" as_nobody "$ctr"
+check "kube: on a read-only root" test "$(p inspect -f '{{.HostConfig.ReadonlyRootfs}}' "$ctr")" = true
+started=$(now_ms)
+p pod stop -t "$grace" "$pod" >/dev/null
+took=$(($(now_ms) - started))
+check "kube: core ends through sigterm, exit 0 ($took ms of ${grace} s)" ordered_stop "$ctr"
+check "kube down removes the pod" p kube down "$manifest"
+
+p rm -f -t 0 ready demo empty closed >/dev/null 2>&1
+check "no container and no pod is left" test -z "$(p ps -aq)$(p pod ps -q)"
+p rmi -af >/dev/null 2>&1
+check "no image is left" test -z "$(p images -aq)"
+check "the machine's own podman store and cgroups are as they were" untouched
+echo "$passed passed, $failed failed"
+[ "$failed" -eq 0 ]
