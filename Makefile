@@ -3,6 +3,8 @@ PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
             libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-14-dev \
             clang-format
 FUZZ_SECONDS ?= 30
+# The version, which CMakeLists.txt names once.
+VERSION := $(shell sed -n 's/^project(torvad VERSION \([^ ]*\).*/\1/p' CMakeLists.txt)
 
 .PHONY: all deps build run package test test-asan test-system fuzz bench format format-check clean \
         windows windows-deps test-windows container-deps image test-container
@@ -50,11 +52,10 @@ test: build
 test-system: package
 	@dpkg -s systemd util-linux >/dev/null 2>&1 || { apt-get update && \
 	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux; }
-	tests/system/run.sh build/torvad_$$(sed -n 's/^project(torvad VERSION \([^ ]*\).*/\1/p' CMakeLists.txt)_amd64.deb build/demo_core
+	tests/system/run.sh build/torvad_$(VERSION)_amd64.deb build/demo_core
 
 # --- The OCI image: torvad and the demo product, FROM scratch, offline -------
 CONTAINER_PACKAGES := podman runc conmon containernetworking-plugins catatonit busybox-static
-VERSION := $(shell sed -n 's/^set(CPACK_PACKAGE_VERSION \(.*\))/\1/p' CMakeLists.txt)
 # podman on the build's own storage: the machine's image store stays as it was.
 IMAGE_PODMAN := packaging/container/podman.sh build/containers
 
