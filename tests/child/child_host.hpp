@@ -31,7 +31,7 @@ bool take_pipe_name(int n);
 // False where there are no such events (Linux) or it can't be sent.
 bool console_event(int n);
 // Named for a tool of the system that the tests run (Windows: powershell,
-// schtasks, sleep), the child stands in for it and gives its exit code; -1
+// schtasks), the child stands in for it and gives its exit code; -1
 // when the name is no such tool's (on Linux shell scripts and the system's
 // own tools serve).
 int stand_in_for_tool(const char* self);

@@ -121,17 +121,13 @@ std::string command_line_arguments() {
 
 } // namespace
 
-// sleep waits its seconds. schtasks and powershell append their arguments as
+// schtasks and powershell append their arguments as
 // a line to <tool>.log in the working directory; powershell then prints the
 // script behind -file, and fails when there is none.
 int stand_in_for_tool(const char* self) {
     std::string tool = std::filesystem::path(self).stem().string();
     for (auto& c : tool)
         c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-    if (tool == "sleep" && __argc > 1) {
-        Sleep(static_cast<DWORD>(std::atoi(__argv[1])) * 1000);
-        return 0;
-    }
     if (tool != "schtasks" && tool != "powershell")
         return -1;
     std::ofstream(tool + ".log", std::ios::app | std::ios::binary)

@@ -3,7 +3,6 @@
 //   test_child <mode> [args...] [ipc fd, appended by torvad]
 #include <algorithm>
 #include <chrono>
-#include <csignal>
 #include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
@@ -108,24 +107,11 @@ int mode_exit(const context& how) {
     return how.number(0);
 }
 
-int mode_fail_once(const context& how) {
-    if (how.args.empty() || !create_once(how.args[0]))
-        return serve(how, true);
-    say("failing");
-    return 3;
-}
-
 // What the child was started with, as the lines of the host's report.
 int mode_fds(const context& how) {
     for (const auto& line : child_host::start_state(how.ipc_fd))
         say("%s", line.c_str());
     return serve(how, true);
-}
-
-int mode_signal(const context& how) {
-    std::signal(how.number(0), SIG_DFL);
-    raise(how.number(0));
-    return 0;
 }
 
 int mode_echo(const context&) {
@@ -164,40 +150,6 @@ int mode_close_ipc(const context& how) {
     say("closed ipc pid=%d", child_host::own_pid());
     std::this_thread::sleep_for(std::chrono::seconds(30));
     return 0;
-}
-
-// Has two channels run (one lists its fds, one sleeps), then fails once;
-// started again, it ignores sigterm.
-int mode_spawn_once(const context& how) {
-    if (how.args.empty() || !create_once(how.args[0]))
-        return serve(how, false);
-    connection link(how.ipc_fd);
-    greet(link);
-    link.execute(1, 0, {how.self, "fds"});
-    link.execute(2, 0, {"sleep", "30"});
-    peer::packet packet;
-    for (int opened = 0; opened < 2 && link.receive(packet);)
-        if (packet.header.type == packet_opened && ++opened && packet.header.channel == 2)
-            say("spawned pid=%u", packet.header.flags);
-    return 3;
-}
-
-// The first time (no MARKER yet): has ITEMS run on channel 1 with FLAGS,
-// waits for OPENS opened packets and exits 3, leaving the channel behind;
-// then, started again, serves.
-//   leave-channel MARKER OPENS FLAGS ITEMS...
-int mode_leave_channel(const context& how) {
-    if (how.args.size() < 4 || !create_once(how.args[0]))
-        return serve(how, true);
-    connection link(how.ipc_fd);
-    greet(link);
-    link.execute(1, static_cast<std::uint32_t>(how.number(2)),
-                 {how.args.begin() + 3, how.args.end()});
-    peer::packet packet;
-    for (int opened = 0; opened < how.number(1) && link.receive(packet);)
-        opened += packet.header.type == packet_opened;
-    say("left");
-    return 3;
 }
 
 // Runs "echo" as a channel with relayed streams and checks what comes back:
@@ -241,11 +193,17 @@ int mode_relay(const context& how) {
 // and "!rmcwd" removes the working directory. Everything between two
 // "!rmcwd" goes out in one write, as a peer that pipelines sends it. Reports
 // each opened, stdout and end per channel as it comes.
+// Led by "once MARKER OPENS", the first time (no MARKER yet) it waits for
+// OPENS opened packets instead and exits 3, leaving its channels behind;
+// started again, it serves.
 int mode_execute(const context& how) {
+    bool once = how.args.size() > 2 && how.args[0] == "once";
+    if (once && !create_once(how.args[1]))
+        return serve(how, true);
     connection link(how.ipc_fd);
     greet(link);
     std::vector<std::vector<std::string>> requests(1);
-    for (const auto& arg : how.args) {
+    for (const auto& arg : std::vector(how.args.begin() + (once ? 3 : 0), how.args.end())) {
         if (arg == "+")
             requests.emplace_back();
         else
@@ -258,7 +216,8 @@ int mode_execute(const context& how) {
         batch.append(block.begin(), block.end());
     };
     auto flush = [&] {
-        peer::write_link(how.ipc_fd, batch.data(), batch.size());
+        if (!batch.empty())
+            peer::write_link(how.ipc_fd, batch.data(), batch.size());
         batch.clear();
     };
     std::uint32_t next = 0, channel = 0, expected = 0;
@@ -280,6 +239,12 @@ int mode_execute(const context& how) {
     }
     flush();
     peer::packet packet;
+    if (once) {
+        for (int opened = 0; opened < how.number(2) && link.receive(packet);)
+            opened += packet.header.type == packet_opened;
+        say("left");
+        return 3;
+    }
     for (std::uint32_t ends = 0; ends < expected && link.receive(packet);) {
         const auto& h = packet.header;
         if (h.type == packet_sigterm)
@@ -318,41 +283,12 @@ int mode_squat(const context& how) {
     return mode_execute({how.self, {how.args.begin() + 1, how.args.end()}, how.ipc_fd});
 }
 
-// Writes MiB mebibytes to stdout, then creates the marker file.
-int mode_write(const context& how) {
-    std::string block(1 << 20, 'w');
-    for (int i = 0; i < how.number(0); ++i)
-        if (!child_host::write_stream(1, block.data(), block.size()))
-            return 1;
-    create_once(how.args[1]);
-    return 0;
-}
-
-// A peer that stops reading while a channel floods it: it reads again when
-// the writer is done or after two seconds, and counts what arrives.
-int mode_flood_out(const context& how) {
-    connection link(how.ipc_fd);
-    greet(link);
-    std::string marker = how.args[1];
-    link.execute(1, execute_stdio_pipes, {how.self, "write", how.args[0], marker});
-    for (int waited = 0; waited < 200 && !fs::exists(marker); ++waited)
-        std::this_thread::sleep_for(milliseconds(10));
-    std::size_t bytes = 0;
-    peer::packet packet;
-    while (link.receive(packet) && packet.header.type != packet_closed)
-        bytes += packet.header.type == packet_stdout ? packet.payload.size() : 0;
-    say("flood-out %s bytes closed %u", std::to_string(bytes).c_str(), packet.header.flags);
-    return await_sigterm(link, true);
-}
-
-// A peer that floods the stdin of a channel (by default one that never reads
-// it); a send that can't go out within half a second means torvad holds back.
+// A peer that floods the stdin of the channel COMMAND; a send that can't go
+// out within half a second means torvad holds back.
 int mode_flood_in(const context& how) {
     connection link(how.ipc_fd);
     greet(link);
-    std::vector<std::string> command = how.args;
-    link.execute(1, execute_stdio_pipes,
-                 command.empty() ? std::vector<std::string>{how.self, "sleep", "3s"} : command);
+    link.execute(1, execute_stdio_pipes, how.args);
     link.limit_send_wait(500);
     std::string chunk(packet_max_payload, 'i');
     std::size_t sent = 0;
@@ -381,7 +317,6 @@ struct mode {
 
 const mode modes[] = {
     {"exit", mode_exit},
-    {"fail-once", mode_fail_once},
     {"peer",
      [](const context& how) {
          return serve(how, true);
@@ -391,18 +326,13 @@ const mode modes[] = {
          return serve(how, false);
      }},
     {"fds", mode_fds},
-    {"signal", mode_signal},
     {"echo", mode_echo},
     {"record", mode_record},
     {"sleep", mode_sleep},
     {"raw", mode_raw},
     {"close-ipc", mode_close_ipc},
-    {"spawn-once", mode_spawn_once},
-    {"leave-channel", mode_leave_channel},
     {"relay", mode_relay},
     {"execute", mode_execute},
-    {"write", mode_write},
-    {"flood-out", mode_flood_out},
     {"flood-in", mode_flood_in},
     {"orphans", mode_orphans},
     {"args", mode_args},

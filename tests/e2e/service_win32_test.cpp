@@ -1,50 +1,34 @@
 // The service path under the system's service control manager: created,
 // started, queried and stopped with sc.exe, the child ending through its
 // sigterm packet, as an installation runs torvad.
-#include <windows.h>
-
+#include <boost/process/child.hpp>
+#include <boost/process/environment.hpp>
+#include <boost/process/io.hpp>
+#include <boost/process/pipe.hpp>
 #include <gtest/gtest.h>
 
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <thread>
 
 #include "tests/e2e/harness.hpp"
 
 using namespace e2e;
+namespace bp = boost::process;
 
 namespace {
 
 // Runs a tool of the system to its end; its output, both streams, and its
 // exit code in exit_code.
-std::string run_tool(std::string command, DWORD* exit_code = nullptr) {
-    SECURITY_ATTRIBUTES inheritable{sizeof inheritable, nullptr, TRUE};
-    HANDLE ours = nullptr, theirs = nullptr;
-    if (!CreatePipe(&ours, &theirs, &inheritable, 0))
-        return "CreatePipe failed";
-    SetHandleInformation(ours, HANDLE_FLAG_INHERIT, 0);
-    STARTUPINFOA start{};
-    start.cb = sizeof start;
-    start.dwFlags = STARTF_USESTDHANDLES;
-    start.hStdOutput = start.hStdError = theirs;
-    PROCESS_INFORMATION started{};
-    bool ran = CreateProcessA(nullptr, command.data(), nullptr, nullptr, TRUE, 0, nullptr, nullptr,
-                              &start, &started);
-    CloseHandle(theirs);
-    std::string output = ran ? "" : "CreateProcessA failed";
-    char buffer[4096];
-    DWORD got = 0;
-    while (ran && ReadFile(ours, buffer, sizeof buffer, &got, nullptr) && got > 0)
-        output.append(buffer, got);
-    CloseHandle(ours);
-    if (ran) {
-        WaitForSingleObject(started.hProcess, INFINITE);
-        if (exit_code != nullptr)
-            GetExitCodeProcess(started.hProcess, exit_code);
-        CloseHandle(started.hProcess);
-        CloseHandle(started.hThread);
-    }
+std::string run_tool(const std::string& command, int* exit_code = nullptr) {
+    bp::ipstream out;
+    bp::child tool(command, (bp::std_out & bp::std_err) > out);
+    std::string output{std::istreambuf_iterator<char>(out), {}};
+    tool.wait();
+    if (exit_code != nullptr)
+        *exit_code = tool.exit_code();
     return output;
 }
 
@@ -67,7 +51,7 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     for (bool product : {false, true}) {
         SCOPED_TRACE(product ? "core.exe" : "explicit command");
         scratch_dir dir;
-        std::string name = "torvad_test_" + std::to_string(GetCurrentProcessId());
+        std::string name = "torvad_test_" + std::to_string(boost::this_process::get_id());
         std::string record = dir.path + (product ? "/core.log" : "/child.log");
         std::string pid_file = dir.path + "/pid";
         std::string command =
@@ -79,10 +63,10 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
             command += " -- \\\"" + std::string(child_binary) + "\\\" record " + record;
         }
         // Wine's sc tells a success by its exit code alone.
-        DWORD created = 1;
+        int created = 1;
         std::string said =
             run_tool("sc create " + name + " binpath= \"" + command + "\"", &created);
-        ASSERT_EQ(created, 0u) << said;
+        ASSERT_EQ(created, 0) << said;
 
         run_tool("sc start " + name);
         auto state_is = [&name](const char* state) {
