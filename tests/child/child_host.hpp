@@ -10,11 +10,6 @@ namespace child_host {
 
 // Standard streams that carry bytes as they are (Windows would turn \n into \r\n).
 void prepare_streams();
-int own_pid();
-// Bytes read from standard input, 0 at its end, -1 on an error.
-long read_input(char* buffer, std::size_t size);
-// Writes all of data to standard output (1) or standard error (2).
-bool write_stream(int stream, const char* data, std::size_t size);
 // Lines on what the child was started with: the descriptors it holds beside
 // ipc_fd, its signals, its account, what of the environment it should not see.
 std::vector<std::string> start_state(int ipc_fd);

@@ -52,18 +52,6 @@ std::string descriptor_report(int ipc_fd) {
 
 void prepare_streams() {}
 
-int own_pid() {
-    return getpid();
-}
-
-long read_input(char* buffer, std::size_t size) {
-    return read(0, buffer, size);
-}
-
-bool write_stream(int stream, const char* data, std::size_t size) {
-    return write(stream, data, size) == static_cast<ssize_t>(size);
-}
-
 std::vector<std::string> start_state(int ipc_fd) {
     std::vector<std::string> lines{"fds " + descriptor_report(ipc_fd)};
     if (std::getenv("NOTIFY_SOCKET") != nullptr)

@@ -3,6 +3,7 @@
 #include <tlhelp32.h>
 
 #include <cctype>
+#include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
 #include <filesystem>
@@ -27,30 +28,6 @@ void prepare_streams() {
     for (int stream : {0, 1, 2})
         _setmode(stream, _O_BINARY);
     SetConsoleCtrlHandler(ignore_interrupt, TRUE);
-}
-
-int own_pid() {
-    return static_cast<int>(GetCurrentProcessId());
-}
-
-long read_input(char* buffer, std::size_t size) {
-    DWORD got = 0;
-    if (ReadFile(GetStdHandle(STD_INPUT_HANDLE), buffer, static_cast<DWORD>(size), &got, nullptr))
-        return static_cast<long>(got);
-    // The writer's close shows as a broken pipe: the end of the input.
-    return GetLastError() == ERROR_BROKEN_PIPE ? 0 : -1;
-}
-
-bool write_stream(int stream, const char* data, std::size_t size) {
-    HANDLE out = GetStdHandle(stream == 2 ? STD_ERROR_HANDLE : STD_OUTPUT_HANDLE);
-    while (size > 0) {
-        DWORD put = 0;
-        if (!WriteFile(out, data, static_cast<DWORD>(size), &put, nullptr))
-            return false;
-        data += put;
-        size -= put;
-    }
-    return true;
 }
 
 // Which handles a process holds can't be listed here; the account can.
@@ -141,7 +118,9 @@ int stand_in_for_tool(const char* self) {
         std::stringstream text;
         text << script.rdbuf();
         std::string content = text.str();
-        return script && write_stream(1, content.data(), content.size()) ? 0 : 1;
+        return script && std::fwrite(content.data(), 1, content.size(), stdout) == content.size()
+                   ? 0
+                   : 1;
     }
     return 1;
 }

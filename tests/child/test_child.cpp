@@ -19,12 +19,28 @@
 #include "peer/peer.hpp"
 #include "tests/child/child_host.hpp"
 
+#ifdef _WIN32
+#include <io.h>
+#include <process.h>
+#else
+#include <unistd.h>
+#endif
+
 namespace {
 
 using namespace torvad;
 using peer::connection;
 using std::chrono::milliseconds;
 namespace fs = std::filesystem;
+
+// Writes all of data to standard output (1) or standard error (2), bytes as
+// they are (Windows would turn \n into \r\n but for prepare_streams).
+bool write_stream(int stream, const char* data, std::size_t size) {
+    for (int put = 0; size > 0; data += put, size -= static_cast<std::size_t>(put))
+        if ((put = static_cast<int>(write(stream, data, static_cast<unsigned>(size)))) <= 0)
+            return false;
+    return true;
+}
 
 void say(const char* format, ...) __attribute__((format(printf, 1, 2)));
 void say(const char* format, ...) {
@@ -36,7 +52,7 @@ void say(const char* format, ...) {
     length = 7 + std::min(length, static_cast<int>(sizeof line - 9));
     line[length++] = '\n';
     std::fflush(stdout);
-    child_host::write_stream(1, line, static_cast<std::size_t>(length));
+    write_stream(1, line, static_cast<std::size_t>(length));
     va_end(args);
 }
 
@@ -61,7 +77,7 @@ bool greet(connection& link) {
         return false;
     say("version %s %s Background:%s", version.program_name.c_str(), version.version.c_str(),
         version.background ? "true" : "false");
-    say("ready pid=%d", child_host::own_pid());
+    say("ready pid=%d", getpid());
     return true;
 }
 
@@ -117,11 +133,11 @@ int mode_fds(const context& how) {
 int mode_echo(const context&) {
     char buffer[4096];
     long got;
-    while ((got = child_host::read_input(buffer, sizeof buffer)) > 0)
-        if (!child_host::write_stream(1, buffer, static_cast<std::size_t>(got)))
+    while ((got = read(0, buffer, sizeof buffer)) > 0)
+        if (!write_stream(1, buffer, static_cast<std::size_t>(got)))
             return 1;
     const char eof[] = "child: echo eof\n";
-    return child_host::write_stream(2, eof, sizeof eof - 1) ? 0 : 1;
+    return write_stream(2, eof, sizeof eof - 1) ? 0 : 1;
 }
 
 // "sleep 3s": the unit keeps a bare number from being taken for the ipc fd.
@@ -147,7 +163,7 @@ int mode_raw(const context& how) {
 
 int mode_close_ipc(const context& how) {
     peer::close_link(how.ipc_fd);
-    say("closed ipc pid=%d", child_host::own_pid());
+    say("closed ipc pid=%d", getpid());
     std::this_thread::sleep_for(std::chrono::seconds(30));
     return 0;
 }
@@ -187,19 +203,18 @@ int mode_relay(const context& how) {
     return 4;
 }
 
-// Sends one execute per request, on channels 1, 2, ... or on "#N" when a
-// request begins so; each request is its flags, then its items, and "+"
-// separates requests. "<text" instead sends text to the last request's stdin,
-// and "!rmcwd" removes the working directory. Everything between two
+// Sends one execute per request, on channels 1, 2, ...; each request is its flags, then its items,
+// and "+" separates requests. "<text" instead sends text to the last request's stdin, and "!rmcwd"
+// removes the working directory. Everything between two
 // "!rmcwd" goes out in one write, as a peer that pipelines sends it. Reports
 // each opened, stdout and end per channel as it comes.
 // Led by "once MARKER OPENS", the first time (no MARKER yet) it waits for
 // OPENS opened packets instead and exits 3, leaving its channels behind;
-// started again, it serves.
+// started again, it serves ("once-deaf": ignoring sigterm).
 int mode_execute(const context& how) {
-    bool once = how.args.size() > 2 && how.args[0] == "once";
+    bool once = how.args.size() > 2 && how.args[0].starts_with("once");
     if (once && !create_once(how.args[1]))
-        return serve(how, true);
+        return serve(how, how.args[0] == "once");
     connection link(how.ipc_fd);
     greet(link);
     std::vector<std::vector<std::string>> requests(1);
@@ -229,11 +244,9 @@ int mode_execute(const context& how) {
         } else if (request.size() == 1 && request[0].rfind('<', 0) == 0) {
             add(channel, packet_stdin, 0, request[0].substr(1));
         } else if (request.size() > 1) {
-            bool named = request[0][0] == '#';
-            channel = named ? std::stoul(request[0].substr(1)) : ++next;
-            auto flags = std::stoul(request[named ? 1 : 0]);
-            add(channel, packet_execute, flags,
-                join_strings({request.begin() + 1 + named, request.end()}));
+            channel = ++next;
+            add(channel, packet_execute, std::stoul(request[0]),
+                join_strings({request.begin() + 1, request.end()}));
             ++expected;
         }
     }

@@ -41,12 +41,6 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {"?failed to create child process.", "?failed 24", "!INT", "=0"},
          {.fd_limit = 64},
          systems::linux_only},
-        // requests in one write: each end comes in the order asked, and frees its id at once
-        {requests({"0", missing, "+", "0", child_binary, "exit", "0"}),
-         {"?child: 1 failed 2", "?child: 2 opened", "?child: 2 closed 0", "!INT", "=0"}},
-        {requests({"#1", "0", missing, "+", "#1", "0", child_binary, "exit", "0"}),
-         {"?child: 1 failed 2", "?child: 1 opened", "?child: 1 closed 0", "!INT", "=0",
-          "-already exists"}},
         {requests({"2", missing, "+", "<lost"}),
          {"?child: 1 failed 2", "&channel 0x1 does not exist", "!INT", "=0"}},
         // a working directory deleted under us: only a relative name is not found
