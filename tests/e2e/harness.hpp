@@ -39,6 +39,9 @@ struct options {
     // The first process of a PID namespace of its own, as a container's
     // entrypoint is (needs root); pid() is still its pid as we see it.
     bool pid_namespace = false;
+    // A folder that the run sees as its /dev, in a mount namespace of its own
+    // (needs root); it should hold a file "null".
+    std::string dev;
 };
 
 class daemon_run {

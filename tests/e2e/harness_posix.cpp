@@ -11,6 +11,7 @@
 #include <poll.h>
 #include <pty.h>
 #include <sched.h>
+#include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
@@ -60,6 +61,13 @@ void open_output(bool terminal, int& ours, int& theirs) {
 [[noreturn]] void exec_daemon(const std::vector<std::string>& args, const options& how, int out) {
     setsid();
     unsetenv("NOTIFY_SOCKET");
+    std::string null_node = how.dev + "/null";
+    if (!how.dev.empty() &&
+        (unshare(CLONE_NEWNS) == -1 ||
+         mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == -1 ||
+         mount("/dev/null", null_node.c_str(), nullptr, MS_BIND, nullptr) == -1 ||
+         mount(how.dev.c_str(), "/dev", nullptr, MS_BIND | MS_REC, nullptr) == -1))
+        _exit(125);
     int null_fd = open("/dev/null", O_RDONLY);
     dup2(null_fd, 0);
     if (how.close_stdin)

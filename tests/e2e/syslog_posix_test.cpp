@@ -1,12 +1,8 @@
 // The event log on Linux: syslog records as a log daemon receives them.
 #include <gtest/gtest.h>
 
-#include <fcntl.h>
-#include <sched.h>
-#include <sys/mount.h>
+#include <fstream>
 #include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include "tests/e2e/harness.hpp"
@@ -14,60 +10,21 @@
 using namespace e2e;
 
 namespace {
+
 const char* const started = "successfully started torvad version 1.1.21.0";
-}
 
-namespace {
-
-// Binds a datagram socket at /dev/log inside a private mount namespace of a
-// forked child, runs torvad there and sends back every record it received.
+// The records that torvad sends to /dev/log, in a /dev of the run's own.
 std::string syslog_records(const std::vector<std::string>& args) {
-    scratch_dir dev; // ours, so that it goes when the test does
-    int report[2];
-    if (pipe(report) == -1)
-        return "pipe failed";
-    pid_t helper = fork();
-    if (helper == 0) {
-        close(report[0]);
-        if (unshare(CLONE_NEWNS) == -1 ||
-            mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == -1)
-            _exit(2);
-        // A /dev of our own: what torvad and the pty need, and our /dev/log.
-        std::string null_node = dev.path + "/null", pts = dev.path + "/pts";
-        close(open(null_node.c_str(), O_CREAT | O_WRONLY, 0666));
-        mkdir(pts.c_str(), 0755);
-        if (symlink("pts/ptmx", (dev.path + "/ptmx").c_str()) == -1 ||
-            mount("/dev/null", null_node.c_str(), nullptr, MS_BIND, nullptr) == -1 ||
-            mount("/dev/pts", pts.c_str(), nullptr, MS_BIND | MS_REC, nullptr) == -1)
-            _exit(2);
-        if (mount(dev.path.c_str(), "/dev", nullptr, MS_BIND | MS_REC, nullptr) == -1)
-            _exit(2);
-        int log = bound_datagram_socket("/dev/log");
-        {
-            daemon_run run(args);
-            run.wait_exit();
-        }
-        char record[8192];
-        ssize_t got;
-        while ((got = recv(log, record, sizeof record, MSG_DONTWAIT)) > 0) {
-            ssize_t sent = write(report[1], record, got);
-            sent = write(report[1], "\n", 1);
-            (void)sent;
-        }
-        _exit(0);
-    }
-    close(report[1]);
+    scratch_dir dev;
+    std::ofstream(dev.path + "/null");
+    int log = bound_datagram_socket(dev.path + "/log");
+    daemon_run(args, {.dev = dev.path}).wait_exit();
     std::string records;
-    char buffer[4096];
-    ssize_t got;
-    while ((got = read(report[0], buffer, sizeof buffer)) > 0)
-        records.append(buffer, got);
-    close(report[0]);
-    int status = 0;
-    waitpid(helper, &status, 0);
-    return WIFEXITED(status) && WEXITSTATUS(status) == 0
-               ? records
-               : "helper failed: " + std::to_string(status);
+    char record[8192];
+    for (ssize_t got; (got = recv(log, record, sizeof record, MSG_DONTWAIT)) > 0;)
+        records.append(record, got) += '\n';
+    close(log);
+    return records;
 }
 
 } // namespace
