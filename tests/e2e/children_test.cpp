@@ -10,13 +10,6 @@ using namespace e2e;
 
 namespace {
 
-std::vector<std::string> child(std::vector<std::string> mode,
-                               std::vector<std::string> options = {}) {
-    options.insert(options.end(), {"--", child_binary});
-    options.insert(options.end(), mode.begin(), mode.end());
-    return options;
-}
-
 const char* const stopping = "?stopping torvad version 1.1.21.0...";
 
 } // namespace

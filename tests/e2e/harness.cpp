@@ -119,6 +119,12 @@ bool no_zombie_within(int pid, int timeout_ms) {
     return true;
 }
 
+std::vector<std::string> child(std::vector<std::string> mode, std::vector<std::string> options) {
+    options.insert(options.end(), {"--", child_binary});
+    options.insert(options.end(), mode.begin(), mode.end());
+    return options;
+}
+
 bool file_exists(const std::string& path) {
     std::error_code ignored;
     return std::filesystem::exists(path, ignored);

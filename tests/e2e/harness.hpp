@@ -125,6 +125,9 @@ struct reachable_child {
     std::string path;
 };
 
+// torvad's arguments for the test child in a mode: options, "--", the child, mode.
+std::vector<std::string> child(std::vector<std::string> mode,
+                               std::vector<std::string> options = {});
 bool file_exists(const std::string& path);
 std::string read_file(const std::string& path);
 // Ends process pid as signal_number would; on Windows with the exit code

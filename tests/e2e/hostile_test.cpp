@@ -10,8 +10,8 @@ using namespace e2e;
 namespace {
 
 std::vector<std::string> requests(std::vector<std::string> args) {
-    args.insert(args.begin(), {"--", child_binary, "execute"});
-    return args;
+    args.insert(args.begin(), "execute");
+    return child(args);
 }
 
 } // namespace

@@ -14,15 +14,6 @@
 
 using namespace e2e;
 
-namespace {
-
-std::vector<std::string> child(std::vector<std::string> mode) {
-    mode.insert(mode.begin(), {"--", child_binary});
-    return mode;
-}
-
-} // namespace
-
 // The status text follows the state, naming the persistent children.
 TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
     const char* const running_0 = "@READY=1\nSTATUS=running, 0 children";
