@@ -4,7 +4,7 @@ PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
             clang-format
 FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
-VERSION := $(shell sed -n 's/^project(torvad VERSION \([^ ]*\).*/\1/p' CMakeLists.txt)
+VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
 
 .PHONY: all deps build run package test test-asan test-system fuzz bench format format-check clean \
         windows windows-deps test-windows container-deps image test-container
