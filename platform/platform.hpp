@@ -247,9 +247,11 @@ program_end run_program(const std::string& path, const std::vector<std::string>&
                         returned_stream returned,
                         const std::function<void(const char*, std::size_t)>& on_output);
 
-// The hand-over's job where no task scheduler ("schtasks") is on PATH: one that
-// runs once as the system account after our end, points service_name at
-// core_path and starts the service. False when it could not be scheduled.
-bool schedule_handover_job(const std::string& service_name, const std::string& core_path);
+// The hand-over's job: one that runs once as the system account after our
+// end, points service_name at core_path and starts the service; through the
+// task scheduler ("schtasks") where it is on PATH, else the system's own way
+// (schedule_system_job). False when it could not be scheduled.
+bool schedule_handover(const std::string& service_name, const std::string& core_path);
+bool schedule_system_job(const std::string& service_name, const std::string& core_path);
 
 } // namespace torvad::platform

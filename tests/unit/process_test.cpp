@@ -20,13 +20,11 @@ struct fake_owner final : process_owner {
     pattern_lists everything;
     std::vector<std::shared_ptr<process>> children;
     std::vector<std::uint32_t> ended; // each end's status, as the owner is told it
-    bool restart_killed = false; // makes a successor for a child killed by a signal
+    bool restart_killed = false;      // makes a successor for a child killed by a signal
 
     boost::asio::io_context& loop() override { return context; }
     void adopt(std::shared_ptr<process> child) override { children.push_back(std::move(child)); }
-    void remove(const std::shared_ptr<process>& child) override {
-        std::erase(children, child);
-    }
+    void remove(const std::shared_ptr<process>& child) override { std::erase(children, child); }
     void child_ended(const process& child, std::uint32_t status) override {
         ended.push_back(status);
         if (restart_killed && status > 128)
@@ -86,7 +84,8 @@ class peer_pipe {
                 packet_header header = read_packet_header(buffer_.data());
                 if (buffer_.size() < header.length)
                     break;
-                std::string payload(buffer_, packet_header_size, header.length - packet_header_size);
+                std::string payload(buffer_, packet_header_size,
+                                    header.length - packet_header_size);
                 buffer_.erase(0, header.length);
                 if (header.type != packet_version)
                     packets.push_back({header.channel, header.type, header.flags, payload});
@@ -103,7 +102,8 @@ class peer_pipe {
         std::string text;
         for (const auto& p : packets)
             if (p.channel == channel)
-                text += p.type <= packet_stderr ? p.payload : std::string("<") + packet_type_name(p.type) + ">";
+                text += p.type <= packet_stderr ? p.payload
+                                                : std::string("<") + packet_type_name(p.type) + ">";
         return text;
     }
 
@@ -145,7 +145,8 @@ TEST(process, output_waits_for_a_requester_that_does_not_read) {
     fake_owner owner;
     peer_pipe peer(owner);
     const std::size_t size = 4 << 20;
-    peer.execute(1, execute_stdio_pipes, "head -c " + std::to_string(size) + " /dev/zero | tr '\\0' x");
+    peer.execute(1, execute_stdio_pipes,
+                 "head -c " + std::to_string(size) + " /dev/zero | tr '\\0' x");
     owner.context.run_for(std::chrono::milliseconds(500));
     EXPECT_TRUE(owner.ended.empty()) << "the whole output was taken while nobody read it";
     ASSERT_TRUE(peer.read_until(1, packet_closed));
