@@ -8,6 +8,7 @@
 
 #include "ipc/execute.hpp"
 #include "ipc/strings.hpp"
+#include "platform/platform.hpp"
 
 using namespace torvad;
 
@@ -20,8 +21,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     pattern_lists patterns = parse_patterns(input.substr(0, split), "exec.patterns", problems);
     std::uint32_t flags = static_cast<unsigned char>(input[split + 2]);
     std::string_view payload = input.substr(split + 3);
-    execute_decision decision =
-        decide_execute(flags, payload.data(), payload.size(), "svc", "/srv", patterns);
+    execute_decision decision = decide_execute(flags, payload.data(), payload.size(), "svc", "/srv",
+                                               patterns, platform::thread_cpu_nanoseconds);
     if (decision.refusal != nullptr)
         return 0;
     const execute_request& request = decision.request;

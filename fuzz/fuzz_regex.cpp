@@ -5,8 +5,8 @@
 #include <regex>
 #include <string>
 
-#include "ipc/bounded_regex.hpp"
-#include "ipc/regex_automaton.hpp"
+#include "matcher/automaton.hpp"
+#include "matcher/bounded_regex.hpp"
 #include "platform/platform.hpp"
 
 using torvad::bounded_regex;
@@ -106,7 +106,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     if (!bounded)
         return 0;
 
-    match_verdict verdict = bounded->match(text);
+    match_verdict verdict = bounded->match(text, torvad::platform::thread_cpu_nanoseconds);
     if (verdict == match_verdict::undecided) {
         if (must_decide(pattern))
             __builtin_trap();

@@ -28,10 +28,11 @@ void add_line(pattern_lists& lists, std::string_view line, std::string_view file
 
 // The verdict of the first pattern that matches; undecided when none
 // matched and one of them could not be decided.
-match_verdict match_any(const std::vector<bounded_regex>& list, std::string_view text) {
+match_verdict match_any(const std::vector<bounded_regex>& list, std::string_view text,
+                        match_clock clock) {
     match_verdict verdict = match_verdict::no_match;
     for (const auto& pattern : list) {
-        match_verdict one = pattern.match(text);
+        match_verdict one = pattern.match(text, clock);
         if (one == match_verdict::match)
             return one;
         if (one == match_verdict::undecided)
@@ -70,21 +71,21 @@ std::size_t patterns_stack_bytes(std::string_view text) {
 }
 
 permission decide_permission(const pattern_lists& patterns, const std::string& requester_user,
-                             const std::string& wanted_user,
-                             const std::vector<std::string>& items) {
+                             const std::string& wanted_user, const std::vector<std::string>& items,
+                             match_clock clock) {
     std::string text = join_strings(items);
     if (wanted_user != requester_user) {
-        match_verdict verdict = match_any(patterns.all, text);
+        match_verdict verdict = match_any(patterns.all, text, clock);
         if (verdict == match_verdict::match)
             return {};
         return {"permission to change user denied", verdict == match_verdict::undecided};
     }
     if (patterns.allow_all)
         return {};
-    match_verdict own = match_any(patterns.exec, text);
+    match_verdict own = match_any(patterns.exec, text, clock);
     if (own == match_verdict::match)
         return {};
-    match_verdict any = match_any(patterns.all, text);
+    match_verdict any = match_any(patterns.all, text, clock);
     if (any == match_verdict::match)
         return {};
     bool undecided = own == match_verdict::undecided || any == match_verdict::undecided;

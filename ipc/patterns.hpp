@@ -7,7 +7,7 @@
 #include <string_view>
 #include <vector>
 
-#include "ipc/bounded_regex.hpp"
+#include "matcher/bounded_regex.hpp"
 
 namespace torvad {
 
@@ -27,13 +27,15 @@ pattern_lists parse_patterns(std::string_view text, std::string_view file_name,
 std::size_t patterns_stack_bytes(std::string_view text);
 
 // The decision for one request: refusal is null when permitted, else the
-// text to log. undecided: a pattern could not be matched within its bounds,
-// and the request is refused for that alone.
+// text to log. undecided: a pattern could not be matched within its bounds
+// (each match on its own, as clock tells them), and the request is refused
+// for that alone.
 struct permission {
     const char* refusal = nullptr;
     bool undecided = false;
 };
 permission decide_permission(const pattern_lists& patterns, const std::string& requester_user,
-                             const std::string& wanted_user, const std::vector<std::string>& items);
+                             const std::string& wanted_user, const std::vector<std::string>& items,
+                             match_clock clock);
 
 } // namespace torvad

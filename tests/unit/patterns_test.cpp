@@ -4,6 +4,7 @@
 
 #include "ipc/execute.hpp"
 #include "ipc/strings.hpp"
+#include "platform/platform.hpp"
 
 using namespace torvad;
 
@@ -14,7 +15,8 @@ const char* const user_denied = "permission to change user denied";
 
 std::string decided(const pattern_lists& lists, const std::string& wanted,
                     const std::vector<std::string>& items) {
-    permission result = decide_permission(lists, "svc", wanted, items);
+    permission result =
+        decide_permission(lists, "svc", wanted, items, platform::thread_cpu_nanoseconds);
     return result.refusal == nullptr ? "permitted" : result.refusal;
 }
 
@@ -67,7 +69,8 @@ TEST(patterns, execute_requests_take_user_and_path_items_first) {
     const pattern_lists lists = parse_patterns("(all) /usr/bin/id\n", "p", problems);
     auto decide = [&](std::uint32_t flags, const std::vector<std::string>& items) {
         std::string payload = join_strings(items);
-        return decide_execute(flags, payload.data(), payload.size(), "svc", "/srv", lists);
+        return decide_execute(flags, payload.data(), payload.size(), "svc", "/srv", lists,
+                              platform::thread_cpu_nanoseconds);
     };
     execute_decision refused = decide(execute_user | execute_path, {"nobody", "/usr/bin/id"});
     EXPECT_STREQ(refused.refusal, "path not specified");
