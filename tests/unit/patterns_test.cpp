@@ -23,7 +23,7 @@ std::string decided(const pattern_lists& lists, const std::string& wanted,
 } // namespace
 
 TEST(patterns, lines_permit_exactly_what_they_say) {
-    std::vector<std::string> problems;
+    std::vector<skipped_line> skipped;
     const pattern_lists lists = parse_patterns("# a comment\n"
                                                "/bin/echo\\0.*\n"
                                                " #not a comment\n"
@@ -33,9 +33,11 @@ TEST(patterns, lines_permit_exactly_what_they_say) {
                                                "\n"
                                                "/bin/true\r\n"
                                                "/bin/last\r",
-                                               "exec.patterns", problems);
-    ASSERT_EQ(problems.size(), 1u);
-    EXPECT_EQ(problems[0].rfind("bad pattern on line 6 of 'exec.patterns' skipped: ", 0), 0u);
+                                               skipped);
+    ASSERT_EQ(skipped.size(), 1u);
+    EXPECT_EQ(describe_skipped(skipped[0], "exec.patterns")
+                  .rfind("bad pattern on line 6 of 'exec.patterns' skipped: ", 0),
+              0u);
     const std::tuple<std::string, std::vector<std::string>, std::string> rows[] = {
         {"svc", {"/bin/echo", "hi", ""}, "permitted"},
         {"svc", {"/bin/echo"}, denied},        // the line spells a second item
@@ -56,7 +58,7 @@ TEST(patterns, lines_permit_exactly_what_they_say) {
     for (const auto& [wanted, items, expected] : rows)
         EXPECT_EQ(decided(lists, wanted, items), expected) << wanted << " " << items[0];
 
-    const pattern_lists open, closed = parse_patterns("# nothing\n", "p", problems);
+    const pattern_lists open, closed = parse_patterns("# nothing\n", skipped);
     EXPECT_EQ(decided(open, "svc", {"anything"}), "permitted");
     EXPECT_EQ(decided(open, "nobody", {"anything"}), user_denied);
     EXPECT_EQ(decided(closed, "svc", {"anything"}), denied);
@@ -65,8 +67,8 @@ TEST(patterns, lines_permit_exactly_what_they_say) {
 // The other refusals, with their statuses, run end to end in the hostile and
 // product tests; these two show only here.
 TEST(patterns, execute_requests_take_user_and_path_items_first) {
-    std::vector<std::string> problems;
-    const pattern_lists lists = parse_patterns("(all) /usr/bin/id\n", "p", problems);
+    std::vector<skipped_line> skipped;
+    const pattern_lists lists = parse_patterns("(all) /usr/bin/id\n", skipped);
     auto decide = [&](std::uint32_t flags, const std::vector<std::string>& items) {
         std::string payload = join_strings(items);
         return decide_execute(flags, payload.data(), payload.size(), "svc", "/srv", lists,
