@@ -2,6 +2,7 @@
 // exactly what the operator wrote, and a bad line never permits more.
 #include <gtest/gtest.h>
 
+#include "entry/patterns_tool.hpp"
 #include "ipc/execute.hpp"
 #include "ipc/strings.hpp"
 #include "platform/platform.hpp"
@@ -85,4 +86,30 @@ TEST(patterns, execute_requests_take_user_and_path_items_first) {
     EXPECT_EQ(accepted.command, std::vector<std::string>{"/usr/bin/id"});
     EXPECT_EQ(accepted.stdio_mode, stdio_none);
     EXPECT_FALSE(accepted.persistent);
+}
+
+// What torvad-patterns check finds: each kind of line torvad skips, and the
+// lines that load but are rarely meant.
+TEST(patterns, check_names_skipped_lines_and_warns) {
+    patterns_file file;
+    file.lists = parse_patterns("# a comment\n"
+                                "/bin/echo\\0.*\n"
+                                "([bad\n"
+                                "x{100000}\n"
+                                "x{99999999999999999999}\n"
+                                "/bin/true \n"
+                                "(all) /bin/echo\\0.*\n",
+                                file.skipped);
+    patterns_tool::report report = patterns_tool::check("p", file);
+    EXPECT_EQ(report.status, 1);
+    for (const char* expected :
+         {"p:3: skipped: ", "\n    ([bad\n", "p:4: skipped: too large to compile",
+          "p:5: skipped: a repeat count or back-reference number is too large",
+          "p:6: warning: a blank", "p:7: warning: repeats line 2",
+          "p: 2 own-account and 1 any-account patterns, 3 lines skipped, 2 warnings"})
+        EXPECT_NE(report.out.find(expected), std::string::npos) << expected << "\n" << report.out;
+    file.skipped.clear();
+    EXPECT_EQ(patterns_tool::check("p", file).status, 0);
+    file.open_failure = "failed to open patterns file 'p'";
+    EXPECT_EQ(patterns_tool::check("p", file).status, 2);
 }
