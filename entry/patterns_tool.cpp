@@ -1,6 +1,7 @@
 #include "entry/patterns_tool.hpp"
 
 #include <algorithm>
+#include <map>
 
 #include "ipc/execute.hpp"
 #include "ipc/strings.hpp"
@@ -46,6 +47,9 @@ void warn(const std::string& path, const pattern_lists& lists, std::string& out,
         ++count;
     };
     std::vector<const pattern_line*> lines;
+    std::map<std::string_view, unsigned> own_lines;
+    for (const auto& line : lists.exec)
+        own_lines.emplace(line.line, line.number);
     for (const auto* list : {&lists.exec, &lists.all})
         for (const auto& line : *list)
             lines.push_back(&line);
@@ -56,12 +60,10 @@ void warn(const std::string& path, const pattern_lists& lists, std::string& out,
         pattern.remove_prefix(for_all ? all_prefix.size() : 0);
         if (!pattern.empty() && (is_blank(pattern.front()) || is_blank(pattern.back())))
             say(*line, "a blank at its start or end is part of the pattern");
-        if (!for_all)
-            continue;
-        for (const auto& own : lists.exec)
-            if (own.line == pattern)
-                say(*line, "repeats line " + std::to_string(own.number) +
-                               " for any account; that line permits nothing more");
+        auto own = own_lines.find(pattern);
+        if (for_all && own != own_lines.end())
+            say(*line, "repeats line " + std::to_string(own->second) +
+                           " for any account; that line permits nothing more");
     }
 }
 
