@@ -82,7 +82,8 @@ TEST(patterns_tool, explains_the_decision_torvad_makes) {
         options how;
         if (holds_here(systems::windows_only))
             how.env = {"PATH=" + dir.path};
-        std::vector<std::string> steps = {"?child: 1 ", "!INT", "=0", "-child: 1 failed 13"};
+        std::vector<std::string> steps = {"?child: 1 ", "!INT", "=0", "-child: 1 failed 13",
+                                          "-child: 1 failed 22"};
         if (status == 13)
             steps = {"?child: 1 failed 13", "!INT", "=0"};
         run_scenario({"-d", dir.path}, steps, how);
