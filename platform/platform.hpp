@@ -90,6 +90,10 @@ account_name split_account(const std::string& user);
 // work throws is thrown here. False when no such thread could be had.
 bool run_on_large_stack(std::size_t stack_bytes, const std::function<void()>& work);
 
+// The CPU time the calling thread has used, in nanoseconds: the clock that
+// bounds a pattern match (a match_clock).
+std::int64_t thread_cpu_nanoseconds();
+
 // --- the event log --------------------------------------------------------------
 
 enum class event_type : std::uint16_t { error = 1, warning = 2, information = 4 };
