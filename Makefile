@@ -4,7 +4,7 @@ PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
             clang-format
 FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
-VERSION := $(shell sed -n 's/^project(torvad VERSION \([^ ]*\).*/\1/p' CMakeLists.txt)
+VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
 
 .PHONY: all deps build run package test test-asan test-system fuzz bench format format-check clean \
         windows windows-deps test-windows container-deps image test-container
@@ -97,6 +97,9 @@ build-fuzz/build.ninja:
 # allocation.
 FUZZ_TARGETS := framing execute regex
 FUZZ_FLAGS_regex := -max_len=129 -dict=fuzz/regex.dict -rss_limit_mb=8192 -malloc_limit_mb=1024
+# Not among the targets: the survey of Boost.Regex as the matcher, which differs
+# (make fuzz FUZZ_TARGETS=regex_boost; FUZZ_REGEX_DIFFERENCES=FILE lists each).
+FUZZ_FLAGS_regex_boost := $(FUZZ_FLAGS_regex)
 fuzz: deps build-fuzz/build.ninja
 	cmake --build build-fuzz --target $(addprefix fuzz_,$(FUZZ_TARGETS))
 	$(foreach target,$(FUZZ_TARGETS),mkdir -p build-fuzz/corpus_$(target) && \

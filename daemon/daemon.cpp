@@ -8,6 +8,7 @@
 
 #include <boost/asio/post.hpp>
 
+#include "daemon/patterns_file.hpp"
 #include "process/process.hpp"
 
 namespace torvad {
@@ -38,24 +39,16 @@ void daemon::configure(const std::string& name, const char* patterns_path) {
 }
 
 void daemon::load_patterns(const char* path) {
-    std::string text;
-    platform::os_error error = platform::read_file(path, text);
-    std::vector<std::string> problems;
-    // The expression compiler recurses as deep as a line is long: it gets a
-    // stack of that size, and a file that can't have one loads as closed.
-    bool parsed = platform::run_on_large_stack(
-        patterns_stack_bytes(text), [&] { patterns_ = parse_patterns(text, path, problems); });
-    if (!parsed) {
-        patterns_ = parse_patterns({}, path, problems);
-        problems.push_back("no stack to compile the patterns of '" + std::string(path) + "'");
+    patterns_file file = load_patterns_file(path);
+    patterns_ = std::move(file.lists);
+    if (!file.open_failure.empty()) {
+        log_error("%s", file.open_failure.c_str());
+        log_verbose("%s", file.open_failure_reason.c_str());
     }
-    // An unreadable file leaves the lists empty: closed, not open.
-    if (error) {
-        log_error("failed to open patterns file '%s'", path);
-        log_verbose("%s", platform::describe(error).c_str());
-    }
-    for (const auto& problem : problems)
-        log_error("%s", problem.c_str());
+    for (const auto& skipped : file.skipped)
+        log_error("%s", describe_skipped(skipped, path).c_str());
+    if (!file.stack_failure.empty())
+        log_error("%s", file.stack_failure.c_str());
 }
 
 void daemon::add_stop_signal(int signal_number) {

@@ -13,6 +13,4 @@ namespace torvad {
 void check_service_program(const std::string& service_name);
 
 // The action of the scheduled task, one string as the scheduler takes it.
-std::string task_action(const std::string& service_name, const std::string& core_path);
-
 } // namespace torvad

@@ -8,6 +8,7 @@
 
 #include "ipc/execute.hpp"
 #include "ipc/strings.hpp"
+#include "platform/platform.hpp"
 
 using namespace torvad;
 
@@ -16,12 +17,12 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     std::size_t split = input.find(std::string_view("\0\0", 2));
     if (split == std::string_view::npos || split + 3 > input.size())
         return 0;
-    std::vector<std::string> problems;
-    pattern_lists patterns = parse_patterns(input.substr(0, split), "exec.patterns", problems);
+    std::vector<skipped_line> skipped;
+    pattern_lists patterns = parse_patterns(input.substr(0, split), skipped);
     std::uint32_t flags = static_cast<unsigned char>(input[split + 2]);
     std::string_view payload = input.substr(split + 3);
-    execute_decision decision =
-        decide_execute(flags, payload.data(), payload.size(), "svc", "/srv", patterns);
+    execute_decision decision = decide_execute(flags, payload.data(), payload.size(), "svc", "/srv",
+                                               patterns, platform::thread_cpu_nanoseconds);
     if (decision.refusal != nullptr)
         return 0;
     const execute_request& request = decision.request;

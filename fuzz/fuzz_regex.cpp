@@ -5,8 +5,9 @@
 #include <regex>
 #include <string>
 
-#include "ipc/bounded_regex.hpp"
-#include "ipc/regex_automaton.hpp"
+#include "fuzz/quick_library.hpp"
+#include "matcher/automaton.hpp"
+#include "matcher/bounded_regex.hpp"
 #include "platform/platform.hpp"
 
 using torvad::bounded_regex;
@@ -16,56 +17,6 @@ namespace {
 
 constexpr std::size_t max_pattern = 64;
 constexpr std::size_t max_text = 64;
-
-// The library's matcher takes exponential time on some of these inputs, so
-// its answer is asked for only when it comes quickly: this iterator counts
-// the matcher's steps and gives up after a fixed number of them.
-struct too_slow {};
-long steps_left;
-
-void step() {
-    if (--steps_left < 0)
-        throw too_slow{};
-}
-
-class counting_iterator {
-  public:
-    using iterator_category = std::bidirectional_iterator_tag;
-    using value_type = char;
-    using difference_type = std::ptrdiff_t;
-    using pointer = const char*;
-    using reference = const char&;
-
-    counting_iterator() { step(); }
-    explicit counting_iterator(const char* at) : at_(at) {}
-    counting_iterator(const counting_iterator& other) : at_(other.at_) { step(); }
-    counting_iterator& operator=(const counting_iterator& other) {
-        step();
-        at_ = other.at_;
-        return *this;
-    }
-    reference operator*() const { return step(), *at_; }
-    counting_iterator& operator++() { return step(), ++at_, *this; }
-    counting_iterator& operator--() { return step(), --at_, *this; }
-    counting_iterator operator++(int) { return step(), counting_iterator(at_++); }
-    counting_iterator operator--(int) { return step(), counting_iterator(at_--); }
-    bool operator==(const counting_iterator& other) const { return step(), at_ == other.at_; }
-
-  private:
-    const char* at_ = nullptr;
-};
-
-bool library_is_quick(const std::regex& expression, const std::string& text) {
-    steps_left = 1'000'000;
-    try {
-        const char* begin = text.data();
-        std::regex_match(counting_iterator(begin), counting_iterator(begin + text.size()),
-                         expression);
-        return true;
-    } catch (const too_slow&) {
-        return false;
-    }
-}
 
 // Only counted repeats, lookaheads and back-references make the work grow
 // beyond text length times pattern length; without them, even in a sanitizer
@@ -106,7 +57,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     if (!bounded)
         return 0;
 
-    match_verdict verdict = bounded->match(text);
+    match_verdict verdict = bounded->match(text, torvad::platform::thread_cpu_nanoseconds);
     if (verdict == match_verdict::undecided) {
         if (must_decide(pattern))
             __builtin_trap();
@@ -116,7 +67,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     // on an empty text: it gets a stack as large as its steps can fill.
     bool differs = false;
     auto ask_library = [&] {
-        differs = library_is_quick(*library, text) &&
+        differs = fuzz::library_is_quick(*library, text) &&
                   (verdict == match_verdict::match) != std::regex_match(text, *library);
     };
     if (!torvad::platform::run_on_large_stack(std::size_t{1} << 30, ask_library) || differs)

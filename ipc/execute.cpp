@@ -35,7 +35,8 @@ execute_decision refused(const char* text, std::uint32_t status, bool undecided 
 
 execute_decision decide_execute(std::uint32_t flags, const char* payload, std::size_t size,
                                 const std::string& requester_user,
-                                const std::string& requester_path, const pattern_lists& patterns) {
+                                const std::string& requester_path, const pattern_lists& patterns,
+                                match_clock clock, std::vector<tried_line>* tried) {
     auto items = split_strings(payload, size, '\0');
     std::string user = requester_user, path = requester_path;
     if ((flags & execute_user) && !take_leading_item(items, user))
@@ -44,7 +45,7 @@ execute_decision decide_execute(std::uint32_t flags, const char* payload, std::s
         return refused("path not specified", status_malformed);
     if (items.front().empty())
         return refused("executable not specified", status_malformed);
-    permission granted = decide_permission(patterns, requester_user, user, items);
+    permission granted = decide_permission(patterns, requester_user, user, items, clock, tried);
     if (granted.refusal != nullptr)
         return refused(granted.refusal, status_not_permitted, granted.undecided);
     execute_decision decision;

@@ -34,6 +34,7 @@ struct execute_decision {
 
 execute_decision decide_execute(std::uint32_t flags, const char* payload, std::size_t size,
                                 const std::string& requester_user,
-                                const std::string& requester_path, const pattern_lists& patterns);
+                                const std::string& requester_path, const pattern_lists& patterns,
+                                match_clock clock, std::vector<tried_line>* tried = nullptr);
 
 } // namespace torvad

@@ -9,29 +9,29 @@ namespace torvad {
 
 namespace {
 
-constexpr std::string_view all_prefix = "(all) ";
-
-void add_line(pattern_lists& lists, std::string_view line, std::string_view file_name,
-              unsigned number, std::vector<std::string>& problems) {
+void add_line(pattern_lists& lists, std::string_view line, unsigned number,
+              std::vector<skipped_line>& skipped) {
     if (line.empty() || line[0] == '#')
         return;
     bool for_all = line.substr(0, all_prefix.size()) == all_prefix;
     std::string error;
     auto compiled = bounded_regex::compile(for_all ? line.substr(all_prefix.size()) : line, error);
     if (!compiled) {
-        problems.push_back("bad pattern on line " + std::to_string(number) + " of '" +
-                           std::string(file_name) + "' skipped: " + error);
+        skipped.push_back({number, std::string(line), std::move(error)});
         return;
     }
-    (for_all ? lists.all : lists.exec).push_back(std::move(*compiled));
+    (for_all ? lists.all : lists.exec).push_back({number, std::string(line), std::move(*compiled)});
 }
 
 // The verdict of the first pattern that matches; undecided when none
 // matched and one of them could not be decided.
-match_verdict match_any(const std::vector<bounded_regex>& list, std::string_view text) {
+match_verdict match_any(const std::vector<pattern_line>& list, std::string_view text,
+                        match_clock clock, std::vector<tried_line>* tried) {
     match_verdict verdict = match_verdict::no_match;
     for (const auto& pattern : list) {
-        match_verdict one = pattern.match(text);
+        match_verdict one = pattern.regex.match(text, clock);
+        if (tried != nullptr)
+            tried->push_back({&pattern, one});
         if (one == match_verdict::match)
             return one;
         if (one == match_verdict::undecided)
@@ -42,8 +42,12 @@ match_verdict match_any(const std::vector<bounded_regex>& list, std::string_view
 
 } // namespace
 
-pattern_lists parse_patterns(std::string_view text, std::string_view file_name,
-                             std::vector<std::string>& problems) {
+std::string describe_skipped(const skipped_line& skipped, std::string_view file_name) {
+    return "bad pattern on line " + std::to_string(skipped.number) + " of '" +
+           std::string(file_name) + "' skipped: " + skipped.reason;
+}
+
+pattern_lists parse_patterns(std::string_view text, std::vector<skipped_line>& skipped) {
     pattern_lists lists;
     lists.allow_all = false;
     unsigned number = 0;
@@ -53,7 +57,7 @@ pattern_lists parse_patterns(std::string_view text, std::string_view file_name,
         // A line written elsewhere may end in CR LF; the CR is not the pattern's.
         if (end != std::string_view::npos && !line.empty() && line.back() == '\r')
             line.remove_suffix(1);
-        add_line(lists, line, file_name, ++number, problems);
+        add_line(lists, line, ++number, skipped);
         text.remove_prefix(end == std::string_view::npos ? text.size() : end + 1);
     }
     return lists;
@@ -70,21 +74,21 @@ std::size_t patterns_stack_bytes(std::string_view text) {
 }
 
 permission decide_permission(const pattern_lists& patterns, const std::string& requester_user,
-                             const std::string& wanted_user,
-                             const std::vector<std::string>& items) {
+                             const std::string& wanted_user, const std::vector<std::string>& items,
+                             match_clock clock, std::vector<tried_line>* tried) {
     std::string text = join_strings(items);
     if (wanted_user != requester_user) {
-        match_verdict verdict = match_any(patterns.all, text);
+        match_verdict verdict = match_any(patterns.all, text, clock, tried);
         if (verdict == match_verdict::match)
             return {};
         return {"permission to change user denied", verdict == match_verdict::undecided};
     }
     if (patterns.allow_all)
         return {};
-    match_verdict own = match_any(patterns.exec, text);
+    match_verdict own = match_any(patterns.exec, text, clock, tried);
     if (own == match_verdict::match)
         return {};
-    match_verdict any = match_any(patterns.all, text);
+    match_verdict any = match_any(patterns.all, text, clock, tried);
     if (any == match_verdict::match)
         return {};
     bool undecided = own == match_verdict::undecided || any == match_verdict::undecided;

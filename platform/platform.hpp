@@ -90,6 +90,10 @@ account_name split_account(const std::string& user);
 // work throws is thrown here. False when no such thread could be had.
 bool run_on_large_stack(std::size_t stack_bytes, const std::function<void()>& work);
 
+// The CPU time the calling thread has used, in nanoseconds: the clock that
+// bounds a pattern match (a match_clock).
+std::int64_t thread_cpu_nanoseconds();
+
 // --- the event log --------------------------------------------------------------
 
 enum class event_type : std::uint16_t { error = 1, warning = 2, information = 4 };
@@ -247,9 +251,11 @@ program_end run_program(const std::string& path, const std::vector<std::string>&
                         returned_stream returned,
                         const std::function<void(const char*, std::size_t)>& on_output);
 
-// The hand-over's job where no task scheduler ("schtasks") is on PATH: one that
-// runs once as the system account after our end, points service_name at
-// core_path and starts the service. False when it could not be scheduled.
-bool schedule_handover_job(const std::string& service_name, const std::string& core_path);
+// The hand-over's job: one that runs once as the system account after our
+// end, points service_name at core_path and starts the service; through the
+// task scheduler ("schtasks") where it is on PATH, else the system's own way
+// (schedule_system_job). False when it could not be scheduled.
+bool schedule_handover(const std::string& service_name, const std::string& core_path);
+bool schedule_system_job(const std::string& service_name, const std::string& core_path);
 
 } // namespace torvad::platform

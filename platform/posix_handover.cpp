@@ -79,7 +79,7 @@ std::vector<std::string> systemd_run_arguments(const std::string& service_name,
 
 } // namespace
 
-bool schedule_handover_job(const std::string& service_name, const std::string& core_path) {
+bool schedule_system_job(const std::string& service_name, const std::string& core_path) {
     std::string tool = search_path("systemd-run");
     return !tool.empty() && run_program(tool, systemd_run_arguments(service_name, core_path),
                                         returned_stream::none, {})

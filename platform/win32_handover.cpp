@@ -5,7 +5,7 @@
 
 namespace torvad::platform {
 
-bool schedule_handover_job(const std::string&, const std::string&) {
+bool schedule_system_job(const std::string&, const std::string&) {
     return false;
 }
 

@@ -2,7 +2,7 @@
 // keeping its id is ours.
 #include "process/process.hpp"
 
-#include "ipc/bounded_regex.hpp"
+#include "matcher/bounded_regex.hpp"
 
 namespace torvad {
 
@@ -18,7 +18,7 @@ void process::handle_execute(const packet_header& header, const char* payload) {
     }
     execute_decision decision =
         decide_execute(header.flags, payload, header.length - packet_header_size, user,
-                       working_directory, owner.patterns());
+                       working_directory, owner.patterns(), platform::thread_cpu_nanoseconds);
     if (decision.refusal != nullptr) {
         if (decision.undecided)
             owner.log_error("a pattern could not be matched within %d ms; refused",

@@ -362,7 +362,8 @@ const mode modes[] = {
 // program: it answers -h with its version on stderr (a file "silent" in its
 // working directory keeps the version back) and otherwise reports as the fds
 // mode does, or records as the record mode does to a file "core.log" that is
-// there, for a run with no console.
+// there, for a run with no console, or sends the requests of the execute mode
+// that a file "core.execute" holds, one argument a line.
 bool is_core(const char* self) {
     std::string name = fs::path(self).filename().string();
     return name == "core" || name == "core.exe";
@@ -378,6 +379,11 @@ int main(int argc, char** argv) {
         return code;
     if (is_core(argv[0]) && fs::exists("core.log"))
         return mode_record({argv[0], {"core.log"}, how.ipc_fd});
+    std::ifstream requests("core.execute", std::ios::binary);
+    for (std::string line; is_core(argv[0]) && std::getline(requests, line);)
+        how.args.push_back(line);
+    if (!how.args.empty())
+        return mode_execute(how);
     if (is_core(argv[0]))
         return mode_fds(how);
     for (int i = 2; i < (how.ipc_fd >= 0 ? argc - 1 : argc); ++i)

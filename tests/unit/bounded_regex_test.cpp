@@ -2,7 +2,7 @@
 // and on lines where the library's own matcher overflows the stack or never ends.
 #include <gtest/gtest.h>
 
-#include "ipc/bounded_regex.hpp"
+#include "matcher/bounded_regex.hpp"
 #include "platform/platform.hpp"
 
 using namespace torvad;
@@ -18,7 +18,7 @@ match_verdict verdict(const std::string& pattern, const std::string& text) {
     std::string error;
     auto compiled = bounded_regex::compile(pattern, error);
     EXPECT_TRUE(compiled) << error;
-    return compiled ? compiled->match(text) : undecided;
+    return compiled ? compiled->match(text, platform::thread_cpu_nanoseconds) : undecided;
 }
 
 std::string repeated(const std::string& part, std::size_t times) {

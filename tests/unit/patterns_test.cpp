@@ -2,8 +2,10 @@
 // exactly what the operator wrote, and a bad line never permits more.
 #include <gtest/gtest.h>
 
+#include "entry/patterns_tool.hpp"
 #include "ipc/execute.hpp"
 #include "ipc/strings.hpp"
+#include "platform/platform.hpp"
 
 using namespace torvad;
 
@@ -14,14 +16,15 @@ const char* const user_denied = "permission to change user denied";
 
 std::string decided(const pattern_lists& lists, const std::string& wanted,
                     const std::vector<std::string>& items) {
-    permission result = decide_permission(lists, "svc", wanted, items);
+    permission result =
+        decide_permission(lists, "svc", wanted, items, platform::thread_cpu_nanoseconds);
     return result.refusal == nullptr ? "permitted" : result.refusal;
 }
 
 } // namespace
 
 TEST(patterns, lines_permit_exactly_what_they_say) {
-    std::vector<std::string> problems;
+    std::vector<skipped_line> skipped;
     const pattern_lists lists = parse_patterns("# a comment\n"
                                                "/bin/echo\\0.*\n"
                                                " #not a comment\n"
@@ -31,9 +34,11 @@ TEST(patterns, lines_permit_exactly_what_they_say) {
                                                "\n"
                                                "/bin/true\r\n"
                                                "/bin/last\r",
-                                               "exec.patterns", problems);
-    ASSERT_EQ(problems.size(), 1u);
-    EXPECT_EQ(problems[0].rfind("bad pattern on line 6 of 'exec.patterns' skipped: ", 0), 0u);
+                                               skipped);
+    ASSERT_EQ(skipped.size(), 1u);
+    EXPECT_EQ(describe_skipped(skipped[0], "exec.patterns")
+                  .rfind("bad pattern on line 6 of 'exec.patterns' skipped: ", 0),
+              0u);
     const std::tuple<std::string, std::vector<std::string>, std::string> rows[] = {
         {"svc", {"/bin/echo", "hi", ""}, "permitted"},
         {"svc", {"/bin/echo"}, denied},        // the line spells a second item
@@ -54,7 +59,7 @@ TEST(patterns, lines_permit_exactly_what_they_say) {
     for (const auto& [wanted, items, expected] : rows)
         EXPECT_EQ(decided(lists, wanted, items), expected) << wanted << " " << items[0];
 
-    const pattern_lists open, closed = parse_patterns("# nothing\n", "p", problems);
+    const pattern_lists open, closed = parse_patterns("# nothing\n", skipped);
     EXPECT_EQ(decided(open, "svc", {"anything"}), "permitted");
     EXPECT_EQ(decided(open, "nobody", {"anything"}), user_denied);
     EXPECT_EQ(decided(closed, "svc", {"anything"}), denied);
@@ -63,11 +68,12 @@ TEST(patterns, lines_permit_exactly_what_they_say) {
 // The other refusals, with their statuses, run end to end in the hostile and
 // product tests; these two show only here.
 TEST(patterns, execute_requests_take_user_and_path_items_first) {
-    std::vector<std::string> problems;
-    const pattern_lists lists = parse_patterns("(all) /usr/bin/id\n", "p", problems);
+    std::vector<skipped_line> skipped;
+    const pattern_lists lists = parse_patterns("(all) /usr/bin/id\n", skipped);
     auto decide = [&](std::uint32_t flags, const std::vector<std::string>& items) {
         std::string payload = join_strings(items);
-        return decide_execute(flags, payload.data(), payload.size(), "svc", "/srv", lists);
+        return decide_execute(flags, payload.data(), payload.size(), "svc", "/srv", lists,
+                              platform::thread_cpu_nanoseconds);
     };
     execute_decision refused = decide(execute_user | execute_path, {"nobody", "/usr/bin/id"});
     EXPECT_STREQ(refused.refusal, "path not specified");
@@ -80,4 +86,30 @@ TEST(patterns, execute_requests_take_user_and_path_items_first) {
     EXPECT_EQ(accepted.command, std::vector<std::string>{"/usr/bin/id"});
     EXPECT_EQ(accepted.stdio_mode, stdio_none);
     EXPECT_FALSE(accepted.persistent);
+}
+
+// What torvad-patterns check finds: each kind of line torvad skips, and the
+// lines that load but are rarely meant.
+TEST(patterns, check_names_skipped_lines_and_warns) {
+    patterns_file file;
+    file.lists = parse_patterns("# a comment\n"
+                                "/bin/echo\\0.*\n"
+                                "([bad\n"
+                                "x{100000}\n"
+                                "x{99999999999999999999}\n"
+                                "/bin/true \n"
+                                "(all) /bin/echo\\0.*\n",
+                                file.skipped);
+    patterns_tool::report report = patterns_tool::check("p", file);
+    EXPECT_EQ(report.status, 1);
+    for (const char* expected :
+         {"p:3: skipped: ", "\n    ([bad\n", "p:4: skipped: too large to compile",
+          "p:5: skipped: a repeat count or back-reference number is too large",
+          "p:6: warning: a blank", "p:7: warning: repeats line 2",
+          "p: 2 own-account and 1 any-account patterns, 3 lines skipped, 2 warnings"})
+        EXPECT_NE(report.out.find(expected), std::string::npos) << expected << "\n" << report.out;
+    file.skipped.clear();
+    EXPECT_EQ(patterns_tool::check("p", file).status, 0);
+    file.open_failure = "failed to open patterns file 'p'";
+    EXPECT_EQ(patterns_tool::check("p", file).status, 2);
 }

@@ -4,22 +4,22 @@
 
 #include <chrono>
 #include <cstdint>
-#include <ctime>
 #include <string_view>
 
-#include "ipc/regex_automaton.hpp"
+#include "matcher/automaton.hpp"
+#include "matcher/bounded_regex.hpp"
 
 namespace torvad::regex {
 
 struct out_of_budget {};
 
 // Work is charged in units of one state visited or one step undone; the
-// thread's CPU clock is read only every few thousand units, so the bound is
-// overrun by at most that much work. CPU time rather than wall time: a busy
-// machine must not turn an ordinary request into a refusal.
+// caller's clock is read only every few thousand units, so the bound is
+// overrun by at most that much work.
 class budget {
   public:
-    explicit budget(std::chrono::nanoseconds allowed) : deadline_(now() + allowed.count()) {}
+    budget(match_clock clock, std::chrono::nanoseconds allowed)
+        : clock_(clock), deadline_(clock() + allowed.count()) {}
 
     // Throws out_of_budget once the time allowed has passed.
     void charge(std::int64_t units) {
@@ -31,18 +31,13 @@ class budget {
   private:
     static constexpr std::int64_t units_between_checks = 4096;
 
-    static std::int64_t now() {
-        timespec spent{};
-        clock_gettime(CLOCK_THREAD_CPUTIME_ID, &spent);
-        return std::int64_t{spent.tv_sec} * 1'000'000'000 + spent.tv_nsec;
-    }
-
     void check() {
-        if (now() >= deadline_)
+        if (clock_() >= deadline_)
             throw out_of_budget{};
         left_ = units_between_checks;
     }
 
+    match_clock clock_;
     std::int64_t deadline_;
     std::int64_t left_ = units_between_checks;
 };

@@ -1,7 +1,7 @@
 // The standard library compiles the expression, which keeps its syntax and its
 // automaton exactly those of std::regex; only the walk over that automaton is
 // ours. Its compiler and states are library internals, read here and nowhere else.
-#include "ipc/regex_automaton.hpp"
+#include "matcher/automaton.hpp"
 
 #include <array>
 #include <map>

@@ -3,7 +3,7 @@
 // consumes the whole text, which this finds in any visiting order.
 #include <memory>
 
-#include "ipc/regex_search.hpp"
+#include "matcher/search.hpp"
 
 namespace torvad::regex {
 

@@ -2,6 +2,7 @@
 // the text it is matched against is chosen by an untrusted child.
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
@@ -15,6 +16,12 @@ struct automaton;
 
 enum class match_verdict { match, no_match, undecided };
 
+// A reading of the clock that bounds a match, in nanoseconds; only the
+// difference of two readings counts. The caller chooses the clock, so that
+// the matcher is plain code: the daemon gives the calling thread's CPU time,
+// because a busy machine must not turn an ordinary request into a refusal.
+using match_clock = std::int64_t (*)();
+
 // One pattern line, compiled once at load. Copies share the compiled form.
 class bounded_regex {
   public:
@@ -25,8 +32,8 @@ class bounded_regex {
 
     // Whole-text match, the same answer std::regex_match(text, std::regex(source,
     // std::regex::ECMAScript)) gives whenever that finishes; undecided when no answer can be
-    // had within this matcher's bounds on time and stack.
-    match_verdict match(std::string_view text) const;
+    // had within this matcher's bounds on time, as clock tells it, and stack.
+    match_verdict match(std::string_view text, match_clock clock) const;
 
   private:
     explicit bounded_regex(std::shared_ptr<const regex::automaton> compiled);
@@ -37,9 +44,9 @@ class bounded_regex {
 // The stack the compiler may need for source, however the line is made.
 std::size_t compile_stack_bytes(std::string_view source);
 
-// The bound on one call of match, in milliseconds of the calling thread's CPU
-// time. Unoptimized and sanitizer builds search thirty to sixty times slower;
-// they allow forty times as long, so that every build decides the same lines.
+// The bound on one call of match, in milliseconds of its clock. Unoptimized and sanitizer builds
+// search thirty to sixty times slower; they allow forty times as long, so that every build decides
+// the same lines.
 #if defined(__OPTIMIZE__) && !defined(__SANITIZE_ADDRESS__)
 constexpr int regex_time_bound_ms = 25;
 #else

@@ -3,14 +3,14 @@
 // is used as it is, on a stack its caller makes large enough; the matching is
 // done by the bounded searches, which give the library's answer whenever they
 // finish in time.
-#include "ipc/bounded_regex.hpp"
+#include "matcher/bounded_regex.hpp"
 
 #include <algorithm>
 #include <limits>
 #include <new>
 #include <regex>
 
-#include "ipc/regex_search.hpp"
+#include "matcher/search.hpp"
 
 namespace torvad {
 
@@ -62,12 +62,12 @@ std::optional<bounded_regex> bounded_regex::compile(std::string_view source, std
     return std::nullopt;
 }
 
-match_verdict bounded_regex::match(std::string_view text) const {
+match_verdict bounded_regex::match(std::string_view text, match_clock clock) const {
     // The backtracking search keeps positions in 32 bits.
     if (text.size() > static_cast<std::size_t>(std::numeric_limits<std::int32_t>::max()))
         return match_verdict::undecided;
     try {
-        regex::budget meter{std::chrono::milliseconds(regex_time_bound_ms)};
+        regex::budget meter{clock, std::chrono::milliseconds(regex_time_bound_ms)};
         bool whole = compiled_->has_backrefs ? regex::match_by_backtracking(*compiled_, text, meter)
                                              : regex::match_by_state_sets(*compiled_, text, meter);
         return whole ? match_verdict::match : match_verdict::no_match;

@@ -6,7 +6,7 @@
 #include <cstring>
 #include <memory>
 
-#include "ipc/regex_search.hpp"
+#include "matcher/search.hpp"
 
 namespace torvad::regex {
 

@@ -1,0 +1,66 @@
+// The standard library's matcher, asked only where it answers quickly: it
+// takes exponential time on some short inputs of the fuzzers.
+#pragma once
+
+#include <iterator>
+#include <optional>
+#include <regex>
+#include <string>
+
+namespace fuzz {
+
+// The library's matcher takes exponential time on some of these inputs, so
+// its answer is asked for only when it comes quickly: this iterator counts
+// the matcher's steps and gives up after a fixed number of them.
+struct too_slow {};
+inline long steps_left;
+
+inline void step() {
+    if (--steps_left < 0)
+        throw too_slow{};
+}
+
+class counting_iterator {
+  public:
+    using iterator_category = std::bidirectional_iterator_tag;
+    using value_type = char;
+    using difference_type = std::ptrdiff_t;
+    using pointer = const char*;
+    using reference = const char&;
+
+    counting_iterator() { step(); }
+    explicit counting_iterator(const char* at) : at_(at) {}
+    counting_iterator(const counting_iterator& other) : at_(other.at_) { step(); }
+    counting_iterator& operator=(const counting_iterator& other) {
+        step();
+        at_ = other.at_;
+        return *this;
+    }
+    reference operator*() const { return step(), *at_; }
+    counting_iterator& operator++() { return step(), ++at_, *this; }
+    counting_iterator& operator--() { return step(), --at_, *this; }
+    counting_iterator operator++(int) { return step(), counting_iterator(at_++); }
+    counting_iterator operator--(int) { return step(), counting_iterator(at_--); }
+    bool operator==(const counting_iterator& other) const { return step(), at_ == other.at_; }
+
+  private:
+    const char* at_ = nullptr;
+};
+
+// The library's answer, or none when it doesn't come within a million steps.
+inline std::optional<bool> library_answer(const std::regex& expression, const std::string& text) {
+    steps_left = 1'000'000;
+    try {
+        const char* begin = text.data();
+        return std::regex_match(counting_iterator(begin), counting_iterator(begin + text.size()),
+                                expression);
+    } catch (const too_slow&) {
+        return std::nullopt;
+    }
+}
+
+inline bool library_is_quick(const std::regex& expression, const std::string& text) {
+    return library_answer(expression, text).has_value();
+}
+
+} // namespace fuzz

@@ -1,0 +1,14 @@
+// The clock of the pattern matcher on Linux.
+#include <ctime>
+
+#include "platform/platform.hpp"
+
+namespace torvad::platform {
+
+std::int64_t thread_cpu_nanoseconds() {
+    timespec spent{};
+    clock_gettime(CLOCK_THREAD_CPUTIME_ID, &spent);
+    return std::int64_t{spent.tv_sec} * 1'000'000'000 + spent.tv_nsec;
+}
+
+} // namespace torvad::platform
