@@ -3,6 +3,7 @@
 //   test_child <mode> [args...] [ipc fd, appended by torvad]
 #include <algorithm>
 #include <chrono>
+#include <csignal>
 #include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
@@ -128,6 +129,12 @@ int mode_fds(const context& how) {
     for (const auto& line : child_host::start_state(how.ipc_fd))
         say("%s", line.c_str());
     return serve(how, true);
+}
+
+int mode_signal(const context& how) {
+    std::signal(how.number(0), SIG_DFL);
+    raise(how.number(0));
+    return 0;
 }
 
 int mode_echo(const context&) {
@@ -339,6 +346,7 @@ const mode modes[] = {
          return serve(how, false);
      }},
     {"fds", mode_fds},
+    {"signal", mode_signal},
     {"echo", mode_echo},
     {"record", mode_record},
     {"sleep", mode_sleep},

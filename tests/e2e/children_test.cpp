@@ -28,10 +28,15 @@ TEST(children, launch_exit_restart_and_stop) {
          {"?child: version torvad 1.1.21.0 Background:false", "?child: ready", "!INT", stopping,
           "?child: sigterm", "?'test_child' exited with 0x0.", "=0"}},
         {child({"exit", "0"}), {"?'test_child' exited with 0x0.", "=0", "-again"}},
+        {child({"exit", "3"}, {"-o"}), {"?'test_child' exited with 0x3.", "=0", "-again"}},
         // failures restart at once, a death by signal counting as 128 + signal
         {child({"no_such_mode"}),
          {"?exited with 0x40.", "?starting 'test_child' again.", "?starting 'test_child' again.",
           "!TERM", stopping, "=0"}},
+        {child({"signal", "9"}),
+         {"?exited with 0x89.", "?again", "?again", "!INT", "=0"},
+         false,
+         systems::linux_only},
         // a storm that ends clean, leaving no zombie behind
         {child({"execute", "once", dir.path + "/failed", "0"}),
          {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "Z", "!TERM",

@@ -74,6 +74,8 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
             run.interrupt_group();
         else if (step[0] == '!')
             run.signal(text == "INT" ? SIGINT : SIGTERM);
+        else if (step[0] == 'M')
+            EXPECT_LT(peak_memory_kib(run.pid()), std::atoi(text.c_str()) * 1024);
         else if (step[0] == '#')
             child = std::atoi(run.wait_value(text).c_str());
         else if (step.rfind("kill ", 0) == 0 && child > 0)

@@ -86,6 +86,7 @@ class daemon_run {
 //   "z"     within 10 s, no child of torvad is a zombie
 //   "&text" waits for text anywhere, cursor kept
 //   "!GROUP" SIGINT to torvad's process group, as a terminal's Ctrl-C
+//   "M<n>"  torvad's peak memory stayed below n MiB
 // A test's own steps, tried before those above; true when it took the step.
 using step_hook = std::function<bool(const std::string& step, daemon_run& run)>;
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
@@ -133,6 +134,8 @@ std::string read_file(const std::string& path);
 // Ends process pid as signal_number would; on Windows with the exit code
 // 128 + signal_number that Linux reports for such a death.
 void kill_process(int pid, int signal_number);
+// The peak resident memory of pid, in KiB.
+long peak_memory_kib(int pid);
 // Children of pid that are zombies (Windows has none).
 int zombie_children(int pid);
 bool no_zombie_within(int pid, int timeout_ms);

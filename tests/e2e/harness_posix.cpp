@@ -231,6 +231,12 @@ reachable_child::reachable_child() : path(dir.path + "/test_child") {
     std::filesystem::copy(child_binary, path);
 }
 
+long peak_memory_kib(int pid) {
+    std::string status = read_file("/proc/" + std::to_string(pid) + "/status");
+    auto peak = status.find("VmHWM:");
+    return peak == std::string::npos ? -1 : std::atol(status.c_str() + peak + 6);
+}
+
 int zombie_children(int pid) {
     std::ifstream children("/proc/" + std::to_string(pid) + "/task/" + std::to_string(pid) +
                            "/children");

@@ -10,6 +10,8 @@
 
 #include <windows.h>
 
+#include <psapi.h>
+
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -389,6 +391,15 @@ bool running_as_root() {
 
 // The build's own copy serves: no account here is kept out of it.
 reachable_child::reachable_child() : path(child_binary) {}
+
+long peak_memory_kib(int pid) {
+    HANDLE process = OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, static_cast<DWORD>(pid));
+    PROCESS_MEMORY_COUNTERS counters{};
+    bool known = process != nullptr && GetProcessMemoryInfo(process, &counters, sizeof counters);
+    if (process != nullptr)
+        CloseHandle(process);
+    return known ? static_cast<long>(counters.PeakWorkingSetSize / 1024) : -1;
+}
 
 int zombie_children(int) {
     return 0;

@@ -55,6 +55,9 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {"?child: 1 stdout hi", "?child: 1 closed 0", "!INT", "=0"},
          {},
          systems::linux_only},
+        // a peer that floods a child's stdin that is never read
+        {child({"flood-in", child_binary, "sleep", "3s"}),
+         {"?child: flood-in held", "M96", "!INT", "=0"}},
         // input for a child that closed its stdin is dropped, and holds nothing back
         {{"--", child_binary, "flood-in", "/bin/sh", "-c", "exec sleep 3 0<&-"},
          {"?child: flood-in sent all", "!INT", "=0"},
