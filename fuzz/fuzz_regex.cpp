@@ -33,14 +33,10 @@ bool must_decide(const std::string& pattern) {
 } // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-    std::string input(reinterpret_cast<const char*>(data), size);
-    std::size_t cut = input.find('\n');
-    std::string pattern = input.substr(0, std::min(cut, max_pattern));
-    std::string text = cut == std::string::npos ? "" : input.substr(cut + 1, max_text);
-
-    // The library's own compiler overflows a long on these.
-    if (torvad::regex::has_oversized_number(pattern))
+    auto input = fuzz::split_regex_input(data, size, max_pattern, max_text);
+    if (!input)
         return 0;
+    const std::string &pattern = input->pattern, &text = input->text;
     std::string error;
     std::optional<bounded_regex> bounded = bounded_regex::compile(pattern, error);
     // Refused before the library sees it: the library's own reading of such a

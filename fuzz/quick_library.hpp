@@ -2,10 +2,14 @@
 // takes exponential time on some short inputs of the fuzzers.
 #pragma once
 
+#include <algorithm>
+#include <cstdint>
 #include <iterator>
 #include <optional>
 #include <regex>
 #include <string>
+
+#include "matcher/automaton.hpp"
 
 namespace fuzz {
 
@@ -57,6 +61,22 @@ inline std::optional<bool> library_answer(const std::regex& expression, const st
     } catch (const too_slow&) {
         return std::nullopt;
     }
+}
+
+// An input of the regex fuzzers: a pattern, a line feed, a text, each cut to
+// its most; null when the library's compiler would overflow a long on it.
+struct regex_input {
+    std::string pattern, text;
+};
+inline std::optional<regex_input> split_regex_input(const std::uint8_t* data, std::size_t size,
+                                                    std::size_t max_pattern, std::size_t max_text) {
+    std::string input(reinterpret_cast<const char*>(data), size);
+    std::size_t cut = input.find('\n');
+    regex_input split{input.substr(0, std::min(cut, max_pattern)),
+                      cut == std::string::npos ? "" : input.substr(cut + 1, max_text)};
+    if (torvad::regex::has_oversized_number(split.pattern))
+        return std::nullopt;
+    return split;
 }
 
 inline bool library_is_quick(const std::regex& expression, const std::string& text) {
