@@ -206,22 +206,3 @@ TEST(product, the_working_directory_decides_what_is_supervised) {
         run_scenario({"-d", site.product()}, r.steps, {.env = {"PATH=" + site.root.path + "/bin"}});
     }
 }
-
-// Patterns decide real requests of any size: a 60,000-byte argument against
-// an open-ended line is run, and a line that can't be decided within its
-// bound refuses rather than stalls.
-TEST(product, patterns_decide_requests_of_any_size) {
-    installation site;
-    site.stub("/bin/powershell", "");
-    site.stub("/my product/core", std::string("[ \"$1\" = -h ] && { echo 'core version 7' >&2; "
-                                              "exit 0; }\nexec '") +
-                                      child_binary + "' execute 4 /bin/echo x" +
-                                      std::string(60000, 'x') + " + 4 /bin/true " +
-                                      std::string(60000, 'a') + " \"$@\"");
-    std::ofstream(site.product() + "/exec.patterns") << "/bin/echo\\0x.*\n"
-                                                        "/bin/true\\0(?:a|b?){5000}\n";
-    run_scenario({"-d", site.product()},
-                 {"&could not be matched within", "&permission to execute denied",
-                  "&child: 1 closed 0", "&child: 2 failed 13", "!INT", "=0"},
-                 {.env = {"PATH=" + site.root.path + "/bin"}});
-}
