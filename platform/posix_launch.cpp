@@ -318,6 +318,9 @@ bool continue_if_stopped(exit_watch& watch) {
         return false;
     if (info.si_pid == 0 || info.si_code != CLD_STOPPED)
         return false;
+    // A stop an operator asked for (SIGSTOP) is theirs to end.
+    if (info.si_status != SIGTTIN && info.si_status != SIGTTOU && info.si_status != SIGTSTP)
+        return false;
     return !signal_child(watch.native_handle(), SIGCONT);
 }
 
