@@ -1,23 +1,44 @@
+// torvad runs in a session of its own, with its output on a pseudo-terminal
+// or a pipe, and its exit watched through a pidfd. Under Wine the terminal is
+// its console: Wine gives one to a program on a Unix terminal, draws on it and
+// turns a typed Ctrl-C into the console's event.
 #include "tests/e2e/harness.hpp"
 
 #include <gtest/gtest.h>
 
-#include <cctype>
 #include <chrono>
 #include <csignal>
-#include <cstdlib>
+#include <fcntl.h>
 #include <filesystem>
 #include <fstream>
+#include <poll.h>
+#include <pty.h>
 #include <random>
+#include <sched.h>
 #include <sstream>
+#include <sys/ioctl.h>
+#include <sys/mount.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <termios.h>
 #include <thread>
+#include <unistd.h>
+
+#include "tests/e2e/console_text.hpp"
 
 namespace e2e {
 
-const char* const torvad_binary = TORVAD_BINARY;
-const char* const child_binary = TEST_CHILD_BINARY;
-
 namespace {
+
+const char* const windows_build = std::getenv("TORVAD_WINDOWS_BUILD");
+
+// Windows programs see the Linux root as drive Z:; a launch appends ".exe".
+std::string built(const char* here, const std::string& windows_name) {
+    return windows_build ? "Z:" + std::string(windows_build) + "/" + windows_name : here;
+}
 
 using clock = std::chrono::steady_clock;
 
@@ -26,7 +47,159 @@ int remaining_ms(clock::time_point deadline) {
     return left.count() > 0 ? static_cast<int>(left.count()) : 0;
 }
 
+// The output end: a pty, raw for torvad (no \r\n translation); under Wine
+// wide enough that the console never wraps a line, and cooked, so that a
+// typed Ctrl-C is an interrupt. Or a pipe.
+void open_output(bool terminal, int& ours, int& theirs) {
+    winsize size{100, 8192, 0, 0};
+    int ends[2];
+    if (terminal ? openpty(&ends[0], &ends[1], nullptr, nullptr, &size) == -1 : pipe(ends) == -1)
+        std::abort();
+    ours = ends[0];
+    theirs = ends[1];
+    termios mode{};
+    tcgetattr(theirs, &mode);
+    if (under_wine)
+        mode.c_lflag &= ~tcflag_t(ECHO), mode.c_oflag &= ~tcflag_t(ONLCR);
+    else
+        cfmakeraw(&mode);
+    if (terminal)
+        tcsetattr(theirs, TCSANOW, &mode);
+    fcntl(ours, F_SETFD, FD_CLOEXEC);
+}
+
+// In a session of its own, so that a signal to its group reaches only it and
+// what it starts; under Wine the terminal is its console, so also its stdin.
+[[noreturn]] void exec_daemon(const std::vector<std::string>& args, const options& how, int out) {
+    setsid();
+    unsetenv("NOTIFY_SOCKET");
+    std::string null_node = how.dev + "/null";
+    if (!how.dev.empty() &&
+        (unshare(CLONE_NEWNS) == -1 ||
+         mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == -1 ||
+         mount("/dev/null", null_node.c_str(), nullptr, MS_BIND, nullptr) == -1 ||
+         mount(how.dev.c_str(), "/dev", nullptr, MS_BIND | MS_REC, nullptr) == -1))
+        _exit(125);
+    bool console = under_wine && how.terminal;
+    dup2(console ? out : open("/dev/null", O_RDONLY), 0);
+    if (console)
+        ioctl(0, TIOCSCTTY, 0);
+    if (how.close_stdin)
+        close(0);
+    if (how.ignore_sigchld)
+        signal(SIGCHLD, SIG_IGN);
+    if (how.fd_limit != 0) {
+        rlimit limit{rlim_t(how.fd_limit), rlim_t(how.fd_limit)};
+        setrlimit(RLIMIT_NOFILE, &limit);
+    }
+    for (const auto& variable : how.env)
+        putenv(const_cast<char*>(variable.c_str()));
+    dup2(out, 1);
+    dup2(out, 2);
+    for (int fd = 3; fd < 1024; ++fd)
+        if (fd != how.inherit)
+            close(fd);
+    fcntl(static_cast<int>(how.inherit), F_SETFD, 0);
+    if (!how.directory.empty() && chdir(how.directory.c_str()) == -1)
+        _exit(126);
+    std::vector<std::string> command = {torvad_binary};
+    if (under_wine)
+        command = {"wine", std::string(windows_build) + "/torvad.exe"};
+    command.insert(command.end(), args.begin(), args.end());
+    std::vector<char*> argv;
+    for (auto& arg : command)
+        argv.push_back(arg.data());
+    argv.push_back(nullptr);
+    execvp(argv[0], argv.data());
+    _exit(127);
+}
+
 } // namespace
+
+const bool under_wine = windows_build != nullptr;
+const std::string torvad_binary = built(TORVAD_BINARY, "torvad");
+const std::string child_binary = built(TEST_CHILD_BINARY, "tests/test_child");
+const std::string tool_binary = built(TORVAD_PATTERNS_BINARY, "torvad-patterns.exe");
+const int event_wait_ms = under_wine ? 30000 : 10000;
+
+bool holds_here(systems where) {
+    return where != (under_wine ? systems::linux_only : systems::windows_only);
+}
+
+daemon_run::daemon_run(const std::vector<std::string>& args, const options& how)
+    : console_(under_wine && how.terminal) {
+    int theirs = -1;
+    open_output(how.terminal, out_fd_, theirs);
+    pid_ = fork();
+    if (pid_ == 0)
+        exec_daemon(args, how, theirs);
+    close(theirs);
+}
+
+daemon_run::~daemon_run() {
+    if (!exited_) {
+        kill(pid_, SIGKILL);
+        waitpid(pid_, nullptr, 0);
+    }
+    close(out_fd_);
+}
+
+bool daemon_run::read_some(int timeout_ms) {
+    pollfd ready{out_fd_, POLLIN, 0};
+    char buffer[4096];
+    ssize_t got = 0;
+    if (eof_ || poll(&ready, 1, timeout_ms) <= 0)
+        return false;
+    if ((got = read(out_fd_, buffer, sizeof buffer)) <= 0) {
+        eof_ = true; // a pty gives EIO once every writer has gone
+        return false;
+    }
+    if (!console_) {
+        output_.append(buffer, got);
+        return true;
+    }
+    drawn_.append(buffer, got);
+    drawn_.erase(0, console_text(drawn_, output_));
+    return true;
+}
+
+int daemon_run::wait_exit(int timeout_ms) {
+    auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
+    int pidfd = static_cast<int>(syscall(SYS_pidfd_open, pid_, 0));
+    while (!exited_) {
+        // Output keeps flowing while we wait, and must be drained for a pty.
+        pollfd ready[2] = {{pidfd, POLLIN, 0}, {eof_ ? -1 : out_fd_, POLLIN, 0}};
+        if (poll(ready, 2, remaining_ms(deadline)) <= 0)
+            break;
+        if (ready[1].revents != 0)
+            read_some(0);
+        int status = 0;
+        if (ready[0].revents != 0 && waitpid(pid_, &status, 0) == pid_) {
+            exited_ = true;
+            exit_code_ = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+        }
+    }
+    close(pidfd);
+    // Wine's console may draw the last lines after the program has gone.
+    while (read_some(under_wine ? 200 : 0)) {
+    }
+    return exited_ ? exit_code_ : -1;
+}
+
+// A console under Wine has one stop request, Ctrl-C, whatever was asked for.
+void daemon_run::signal(int signal_number) {
+    if (under_wine)
+        interrupt_group();
+    else
+        kill(pid_, signal_number);
+}
+
+void daemon_run::interrupt_group() {
+    if (under_wine)
+        (void)!write(out_fd_, "\x03", 1);
+    else
+        kill(-pid_, SIGINT);
+}
 
 bool daemon_run::wait_for(const std::string& text, int timeout_ms) {
     auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
@@ -52,11 +225,9 @@ bool daemon_run::wait_anywhere(const std::string& text, int timeout_ms) {
 std::string daemon_run::wait_value(const std::string& key, int timeout_ms) {
     if (!wait_for(key + "=", timeout_ms))
         return {};
-    std::size_t end = cursor_;
-    while (end < output_.size() && !std::isspace(static_cast<unsigned char>(output_[end])))
-        ++end;
+    std::size_t end = output_.find_first_of(" \t\r\n", cursor_);
     std::string value = output_.substr(cursor_, end - cursor_);
-    cursor_ = end;
+    cursor_ = end == std::string::npos ? output_.size() : end;
     return value;
 }
 
@@ -110,15 +281,38 @@ scratch_dir::~scratch_dir() {
     std::filesystem::remove_all(path, ignored);
 }
 
-// A zombie is reaped by the loop's next turn; nothing tells us when that was.
-bool no_zombie_within(int pid, int timeout_ms) {
-    auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
-    while (zombie_children(pid) != 0) {
-        if (clock::now() > deadline)
-            return false;
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return true;
+notify_socket::notify_socket() : fd_(bound_datagram_socket(dir_.path + "/notify")) {}
+
+notify_socket::~notify_socket() {
+    close(fd_);
+}
+
+std::string notify_socket::next(int timeout_ms) {
+    pollfd ready{fd_, POLLIN, 0};
+    char message[256];
+    ssize_t got = poll(&ready, 1, timeout_ms) == 1 ? recv(fd_, message, sizeof message, 0) : 0;
+    return std::string(message, got > 0 ? got : 0);
+}
+
+step_hook service_steps(notify_socket& manager) {
+    return [&manager](const std::string& step, daemon_run& run) {
+        if (step == "!USR2") {
+            run.signal(SIGUSR2);
+        } else if (step == "@*") {
+            while (!manager.next(0).empty()) {
+            }
+        } else if (step[0] == '@') {
+            EXPECT_EQ(manager.next(), step.substr(1)) << run.output();
+        }
+        return step == "!USR2" || step[0] == '@';
+    };
+}
+
+// The build's own copy serves under Wine: no account there is kept out of it.
+reachable_child::reachable_child() : path(under_wine ? child_binary : dir.path + "/test_child") {
+    std::filesystem::permissions(dir.path, std::filesystem::perms(0755));
+    if (!under_wine)
+        std::filesystem::copy(child_binary, path);
 }
 
 std::vector<std::string> child(std::vector<std::string> mode, std::vector<std::string> options) {
@@ -137,6 +331,60 @@ std::string read_file(const std::string& path) {
     std::stringstream text;
     text << file.rdbuf();
     return text.str();
+}
+
+void kill_process(int pid, int signal_number) {
+    kill(pid, signal_number);
+}
+
+long peak_memory_kib(int pid) {
+    std::string status = read_file("/proc/" + std::to_string(pid) + "/status");
+    auto peak = status.find("VmHWM:");
+    return peak == std::string::npos ? -1 : std::atol(status.c_str() + peak + 6);
+}
+
+int zombie_children(int pid) {
+    std::ifstream children("/proc/" + std::to_string(pid) + "/task/" + std::to_string(pid) +
+                           "/children");
+    int zombies = 0;
+    for (pid_t child; !under_wine && children >> child;)
+        zombies +=
+            read_file("/proc/" + std::to_string(child) + "/stat").find(") Z ") != std::string::npos;
+    return zombies;
+}
+
+// A zombie is reaped by the loop's next turn; nothing tells us when that was.
+bool no_zombie_within(int pid, int timeout_ms) {
+    auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
+    while (zombie_children(pid) != 0) {
+        if (clock::now() > deadline)
+            return false;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return true;
+}
+
+bool running_as_root() {
+    return geteuid() == 0;
+}
+
+bool make_link_pair(int& ours, long& theirs) {
+    int fds[2];
+    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) == -1)
+        return false;
+    ours = fds[0];
+    theirs = fds[1];
+    return true;
+}
+
+int bound_datagram_socket(const std::string& path) {
+    int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    path.copy(address.sun_path, sizeof address.sun_path - 1);
+    if (bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == -1)
+        ADD_FAILURE() << "bind " << path;
+    return fd;
 }
 
 } // namespace e2e

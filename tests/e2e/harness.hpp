@@ -1,26 +1,22 @@
 // Runs the real torvad binary for end-to-end tests: stdout on a terminal (the
 // console path) or on a pipe (the service path), with bounded waits for what
-// it prints and for its exit. How a process is started, watched and signalled
-// is the system's part (harness_posix.cpp, harness_win32.cpp); the rest is here.
+// it prints and for its exit. The same tests drive the Windows build under
+// Wine when TORVAD_WINDOWS_BUILD names its folder.
 #pragma once
 
 #include <functional>
-#include <memory>
 #include <string>
 #include <vector>
 
 namespace e2e {
 
-extern const char* const torvad_binary;
-extern const char* const child_binary;
+// The Windows build under Wine, else this system's own.
+extern const bool under_wine;
+// As torvad is started and as the test child and the tool are named to it.
+extern const std::string torvad_binary, child_binary, tool_binary;
 // The bound of a wait for an event: 10 s, and 30 s under Wine, which moves
-// every byte of a pipe through its server and runs the tests some times
-// slower.
+// every byte of a pipe through its server.
 extern const int event_wait_ms;
-// How long the service dispatcher may take to refuse a program that the
-// service manager didn't start: at once on Linux, 10 s under Wine (see
-// harness_win32.cpp).
-extern const int dispatcher_refusal_ms;
 
 // Where a row of a table holds.
 enum class systems { both, linux_only, windows_only };
@@ -28,7 +24,7 @@ bool holds_here(systems where);
 
 struct options {
     bool terminal = true;         // stdout and stderr on a terminal (a console), else a pipe
-    long inherit = -1;            // one more fd (a handle on Windows) the daemon keeps
+    long inherit = -1;            // one more fd the daemon keeps
     std::vector<std::string> env; // NAME=value set in the environment (PATH too)
     std::string directory;        // where it starts; empty: ours
     // The start state a careless parent may leave: a low fd limit, stdin
@@ -36,9 +32,6 @@ struct options {
     int fd_limit = 0;
     bool close_stdin = false;
     bool ignore_sigchld = false;
-    // The first process of a PID namespace of its own, as a container's
-    // entrypoint is (needs root); pid() is still its pid as we see it.
-    bool pid_namespace = false;
     // A folder that the run sees as its /dev, in a mount namespace of its own
     // (needs root); it should hold a file "null".
     std::string dev;
@@ -58,7 +51,7 @@ class daemon_run {
     std::string wait_value(const std::string& key, int timeout_ms = event_wait_ms);
     // The exit code, or -1 when it didn't end in time (it is killed then).
     int wait_exit(int timeout_ms = event_wait_ms);
-    // A stop request: SIGINT or SIGTERM on Linux, Ctrl-C at its console on Windows.
+    // A stop request: the signal on Linux, Ctrl-C typed at the console under Wine.
     void signal(int signal_number);
     // Ctrl-C as a terminal gives it: to torvad and whatever shares its terminal.
     void interrupt_group();
@@ -66,15 +59,11 @@ class daemon_run {
     const std::string& output() const { return output_; }
 
   private:
-    struct system_part; // the process and output handles of this system
     // Appends what is there within timeout_ms to output_; false when nothing came.
     bool read_some(int timeout_ms);
-    std::unique_ptr<system_part> system_;
-    int pid_ = -1;
-    bool eof_ = false;
-    bool exited_ = false;
-    int exit_code_ = -1;
-    std::string output_;
+    int pid_ = -1, out_fd_ = -1, exit_code_ = -1;
+    bool console_, eof_ = false, exited_ = false;
+    std::string output_, drawn_; // drawn_: console bytes not yet told as text
     std::size_t cursor_ = 0;
 };
 
@@ -85,7 +74,7 @@ class daemon_run {
 //   "+text" text appears anywhere                    "Z" no child of torvad is a zombie
 //   "z"     within 10 s, no child of torvad is a zombie
 //   "&text" waits for text anywhere, cursor kept
-//   "!GROUP" SIGINT to torvad's process group, as a terminal's Ctrl-C
+//   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
 //   "M<n>"  torvad's peak memory stayed below n MiB
 // A test's own steps, tried before those above; true when it took the step.
 using step_hook = std::function<bool(const std::string& step, daemon_run& run)>;
@@ -131,21 +120,16 @@ std::vector<std::string> child(std::vector<std::string> mode,
                                std::vector<std::string> options = {});
 bool file_exists(const std::string& path);
 std::string read_file(const std::string& path);
-// Ends process pid as signal_number would; on Windows with the exit code
-// 128 + signal_number that Linux reports for such a death.
 void kill_process(int pid, int signal_number);
 // The peak resident memory of pid, in KiB.
 long peak_memory_kib(int pid);
-// Children of pid that are zombies (Windows has none).
+// Children of pid that are zombies (none under Wine, which has no zombies).
 int zombie_children(int pid);
 bool no_zombie_within(int pid, int timeout_ms);
 bool running_as_root();
-// A connected duplex link, as a caller of -a makes one: ours for a peer
-// connection, theirs for torvad (a socket pair here, a named pipe's two ends
-// opened for overlapped I/O on Windows). False when it can't be made.
+// A connected socket pair, as a caller of -a makes its link: ours for the peer.
 bool make_link_pair(int& ours, long& theirs);
-// A datagram socket bound at path, as a service manager or a log daemon has
-// (Linux only).
+// A datagram socket bound at path, as a service manager or a log daemon has.
 int bound_datagram_socket(const std::string& path);
 
 } // namespace e2e

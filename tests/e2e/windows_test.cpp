@@ -1,0 +1,187 @@
+// The product on Windows, under Wine: the server family's start with copies of
+// the test child standing in for core.exe, powershell.exe and schtasks.exe
+// (each acts by its name and logs the arguments its command line held), the
+// event log, whose records Wine writes to its debug channel, and the service
+// path under Wine's service control manager.
+#include <gtest/gtest.h>
+
+#include <boost/process.hpp>
+
+#include <algorithm>
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "tests/e2e/harness.hpp"
+
+using namespace e2e;
+
+namespace {
+
+// The Windows program of a path the test made, as Wine shows it.
+std::string windows_form(std::string path) {
+    std::replace(path.begin(), path.end(), '/', '\\');
+    return "Z:" + path;
+}
+
+std::string windows_child() {
+    return std::string(std::getenv("TORVAD_WINDOWS_BUILD")) + "/tests/test_child.exe";
+}
+
+// A product directory ("my product", a blank in its path) with the test child
+// as core.exe, and a folder of tool stand-ins in front of PATH.
+struct installation {
+    installation() {
+        std::filesystem::create_directories(product() + "/scripts");
+        std::filesystem::create_directories(root.path + "/bin");
+        std::filesystem::copy(windows_child(), product() + "/core.exe");
+    }
+    void tool(const std::string& name) {
+        std::filesystem::copy(windows_child(), root.path + "/bin/" + name);
+    }
+    std::string product() const { return root.path + "/my product"; }
+    std::string log(const std::string& name) const { return read_file(product() + "/" + name); }
+    std::string path() const { return "WINEPATH=" + windows_form(root.path + "/bin"); }
+    scratch_dir root;
+};
+
+// Runs a program of Wine's to its end; its output, both streams.
+std::string run_wine(const std::vector<std::string>& args, int* exit_code = nullptr) {
+    namespace bp = boost::process;
+    bp::ipstream out;
+    bp::child tool(bp::search_path("wine"), bp::args(args), (bp::std_out & bp::std_err) > out);
+    std::string output{std::istreambuf_iterator<char>(out), {}};
+    tool.wait();
+    if (exit_code != nullptr)
+        *exit_code = tool.exit_code();
+    return output;
+}
+
+// A bounded wait for what the manager or a file shows: they tell no event.
+bool becomes_true(const std::function<bool()>& condition) {
+    for (int tries = 0; tries < 100; ++tries) {
+        if (condition())
+            return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
+    return false;
+}
+
+} // namespace
+
+// Wine can't run core under an account the script names: its LogonUserA
+// hands out a token that no other call takes. So the rows here name none.
+TEST(windows, server_family_start_runs_the_init_script_then_core) {
+    if (!under_wine)
+        GTEST_SKIP() << "the Windows build under Wine";
+    const std::pair<const char*, std::vector<std::string>> rows[] = {
+        {"", {"-deelevate"}},
+        {"\r\r\n", {"-deelevate", "-Failed to logon"}},
+        {nullptr, {"+server init script exited with '1', will not deelevate."}},
+    };
+    for (const auto& [script, checks] : rows) {
+        SCOPED_TRACE(script ? script : "no script");
+        installation site;
+        site.tool("powershell.exe");
+        if (script)
+            std::ofstream(site.product() + "/scripts/init.ps1", std::ios::binary) << script;
+        // Ctrl-C reaches core too: it must be ready to ignore it.
+        std::vector<std::string> steps = {"?child: ready", "!INT", "?child: sigterm",
+                                          "?'core' exited with 0x0.", "=0"};
+        steps.insert(steps.end(), checks.begin(), checks.end());
+        run_scenario({"-d", site.product()}, steps, {.env = {site.path()}});
+        EXPECT_EQ(site.log("powershell.log"),
+                  "-noprofile -noninteractive -executionpolicy bypass -file \"" +
+                      windows_form(site.product()) + "\\.\\scripts\\init.ps1\" .\n");
+    }
+}
+
+// core stays silent on "version": the service is handed over to it, the task
+// scheduler gets its two command lines byte for byte, and torvad ends with 1,
+// its PID file left.
+TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
+    if (!under_wine)
+        GTEST_SKIP() << "the Windows build under Wine";
+    installation site;
+    site.tool("schtasks.exe");
+    site.tool("powershell.exe");
+    std::ofstream(site.product() + "/silent");
+    std::string pid_file = site.root.path + "/pid";
+    run_scenario({"-f", "acme", "-p", pid_file, "-d", site.product()},
+                 {"=1", "-successfully started"}, {.terminal = false, .env = {site.path()}});
+    EXPECT_TRUE(file_exists(pid_file));
+    EXPECT_EQ(site.log("powershell.log"), "");
+    std::string core = windows_form(site.product()) + "\\core.exe";
+    EXPECT_EQ(site.log("schtasks.log"),
+              R"(/create /f /tn startts /sc onstart /ru system /tr "powershell -command )"
+              R"(""start-sleep -s 10; sc.exe config acmeServer binpath= \\"")" +
+                  core +
+                  R"(\\""; sc.exe start torvaSentryServer; schtasks.exe /delete /f /tn startts""")"
+                  "\n/run /tn startts\n");
+}
+
+// Wine's event log is a stub that writes the calls and each record's strings
+// to its debug channels: the source is registered once, and a record has the
+// level's type, category 0, event 0, no user, two strings and no data.
+TEST(windows, event_log_gets_one_record_per_line_with_source_and_type) {
+    if (!under_wine)
+        GTEST_SKIP() << "the Windows build under Wine";
+    const std::string debug = "WINEDEBUG=fixme+advapi,+eventlog";
+    const char* const record = ",0x0000,0x00000000,0000000000000000,0x0002,0x00000000,";
+    run_scenario(
+        {"-l", "-p", "/no/such/dir/pid"},
+        {"?failed to create pid file", "?successfully started", "=0",
+         "+RegisterEventSourceA ((null),\"torvad\")", std::string("+,0x0001") + record,
+         "+err:eventlog:ReportEventW L\"torvad\"\n",
+         "+err:eventlog:ReportEventW L\"failed to create pid file\"\n",
+         std::string("+,0x0004") + record,
+         "+trace:eventlog:ReportEventW L\"successfully started torvad version 1.1.21.0\"\n"},
+        {.env = {debug}});
+    run_scenario({"-p", "/no/such/dir/pid"}, {"?successfully started", "=0", "-EventSource"},
+                 {.env = {debug}});
+}
+
+// Created, started, queried and stopped with sc.exe, as an installation runs
+// torvad: an explicit command, and the product found in the working directory
+// (core.exe records to core.log when that is there); either way the child's
+// record shows version first and the sigterm last.
+TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
+    if (!under_wine)
+        GTEST_SKIP() << "the Windows build under Wine";
+    for (bool product : {false, true}) {
+        SCOPED_TRACE(product ? "core.exe" : "explicit command");
+        scratch_dir dir;
+        std::string name = "torvad_test_" + std::to_string(getpid());
+        std::string record = dir.path + (product ? "/core.log" : "/child.log");
+        std::string pid_file = dir.path + "/pid";
+        std::string command = "\"" + torvad_binary + "\" -p " + pid_file + " -d " + dir.path;
+        if (product) {
+            std::filesystem::copy(windows_child(), dir.path + "/core.exe");
+            std::ofstream{record};
+        } else {
+            command += " -- \"" + child_binary + "\" record " + record;
+        }
+        // Wine's sc tells a success by its exit code alone.
+        int created = 1;
+        std::string said = run_wine({"sc", "create", name, "binpath=", command}, &created);
+        ASSERT_EQ(created, 0) << said;
+        run_wine({"sc", "start", name});
+        auto state_is = [&name](const char* state) {
+            return [&name, state] {
+                return run_wine({"sc", "query", name}).find(state) != std::string::npos;
+            };
+        };
+        EXPECT_TRUE(becomes_true(state_is("RUNNING")));
+        EXPECT_TRUE(becomes_true([&] { return read_file(record).starts_with("version 1.1.21.0"); }))
+            << read_file(record);
+        EXPECT_TRUE(file_exists(pid_file));
+
+        run_wine({"sc", "stop", name});
+        EXPECT_TRUE(becomes_true(state_is("STOPPED")));
+        EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("sigterm\n"); }))
+            << read_file(record);
+        EXPECT_TRUE(becomes_true([&] { return !file_exists(pid_file); }));
+        run_wine({"sc", "delete", name});
+    }
+}
