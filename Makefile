@@ -162,9 +162,12 @@ windows: windows-deps $(WIN)/build.ninja
 # so that each test program doesn't start its own. The session's own programs
 # (its service manager and devices) start first, on /dev/null: started by a
 # test they would hold that test's output open for as long as they run.
-test-windows: windows
+# The unit tests are the Windows build's own; the end-to-end tests are this
+# system's, driving the Windows build's programs.
+test-windows: windows build
 	test -f $(WIN)/wine/system.reg || $(WINE_ENV) wineboot --init </dev/null >/dev/null 2>&1
 	$(WINE_ENV) wineserver --kill 2>/dev/null; $(WINE_ENV) wineserver --persistent </dev/null >/dev/null 2>&1
 	$(WINE_ENV) wine cmd /c exit </dev/null >/dev/null 2>&1
-	$(WINE_ENV) ctest --test-dir $(WIN) --output-on-failure -j2; \
-	  status=$$?; $(WINE_ENV) wineserver --kill; exit $$status
+	$(WINE_ENV) ctest --test-dir $(WIN) --output-on-failure -j2 && \
+	  $(WINE_ENV) TORVAD_WINDOWS_BUILD=$(CURDIR)/$(WIN) ctest --test-dir build -L e2e \
+	    --output-on-failure -j2; status=$$?; $(WINE_ENV) wineserver --kill; exit $$status

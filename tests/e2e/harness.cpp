@@ -6,6 +6,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
 #include <csignal>
 #include <fcntl.h>
@@ -35,9 +36,13 @@ namespace {
 
 const char* const windows_build = std::getenv("TORVAD_WINDOWS_BUILD");
 
-// Windows programs see the Linux root as drive Z:; a launch appends ".exe".
-std::string built(const char* here, const std::string& windows_name) {
-    return windows_build ? "Z:" + std::string(windows_build) + "/" + windows_name : here;
+// Windows programs see the Linux root as drive Z:.
+std::string built(const char* here, std::string windows_name) {
+    if (!windows_build)
+        return here;
+    windows_name = "Z:" + std::string(windows_build) + "/" + windows_name;
+    std::replace(windows_name.begin(), windows_name.end(), '/', '\\');
+    return windows_name;
 }
 
 using clock = std::chrono::steady_clock;
@@ -117,9 +122,14 @@ void open_output(bool terminal, int& ours, int& theirs) {
 } // namespace
 
 const bool under_wine = windows_build != nullptr;
-const std::string torvad_binary = built(TORVAD_BINARY, "torvad");
+const std::string torvad_binary = built(TORVAD_BINARY, "torvad.exe");
 const std::string child_binary = built(TEST_CHILD_BINARY, "tests/test_child");
-const std::string tool_binary = built(TORVAD_PATTERNS_BINARY, "torvad-patterns.exe");
+const std::string child_file =
+    windows_build ? std::string(windows_build) + "/tests/test_child.exe" : TEST_CHILD_BINARY;
+const std::vector<std::string> tool_command =
+    windows_build ? std::vector<std::string>{"/usr/bin/wine",
+                                             std::string(windows_build) + "/torvad-patterns.exe"}
+                  : std::vector<std::string>{TORVAD_PATTERNS_BINARY};
 const int event_wait_ms = under_wine ? 30000 : 10000;
 
 bool holds_here(systems where) {

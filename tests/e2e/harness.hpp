@@ -12,8 +12,10 @@ namespace e2e {
 
 // The Windows build under Wine, else this system's own.
 extern const bool under_wine;
-// As torvad is started and as the test child and the tool are named to it.
-extern const std::string torvad_binary, child_binary, tool_binary;
+// torvad and the test child as torvad names them; the test child's file and
+// the command that runs torvad-patterns, as this system names them.
+extern const std::string torvad_binary, child_binary, child_file;
+extern const std::vector<std::string> tool_command;
 // The bound of a wait for an event: 10 s, and 30 s under Wine, which moves
 // every byte of a pipe through its server.
 extern const int event_wait_ms;

@@ -17,10 +17,11 @@ namespace {
 // The tool's exit status; what it printed in out.
 int explain(const std::string& file, const std::vector<std::string>& request, std::string& out) {
     namespace bp = boost::process;
-    std::vector<std::string> args = {"explain", file};
+    std::vector<std::string> args(tool_command.begin() + 1, tool_command.end());
+    args.insert(args.end(), {"explain", file});
     args.insert(args.end(), request.begin(), request.end());
     bp::ipstream output;
-    bp::child tool(TORVAD_PATTERNS_BINARY, bp::args(args), bp::std_out > output);
+    bp::child tool(tool_command[0], bp::args(args), bp::std_out > output);
     out.assign(std::istreambuf_iterator<char>(output), {});
     tool.wait();
     return tool.exit_code();
@@ -56,8 +57,7 @@ TEST(patterns_tool, explains_the_decision_torvad_makes) {
          {"--", "/bin/echo", "x" + longest},
          "refused: undecided within the bounds\n    line 1 (undecided)"},
     };
-    const std::string core =
-        std::string("core") + (holds_here(systems::windows_only) ? ".exe" : "");
+    const std::string core = under_wine ? "core.exe" : "core";
     for (const auto& r : rows) {
         if (!holds_here(r.where))
             continue;
@@ -76,12 +76,7 @@ TEST(patterns_tool, explains_the_decision_torvad_makes) {
         for (auto item = r.request.begin() + (account ? 3 : 1); item != r.request.end(); ++item)
             requests << *item << "\n";
         requests.close();
-        std::filesystem::copy(std::string(child_binary) + (core == "core" ? "" : ".exe"),
-                              dir.path + "/" + core);
-        // Under Wine no init script is found on this PATH.
-        options how;
-        if (holds_here(systems::windows_only))
-            how.env = {"PATH=" + dir.path};
+        std::filesystem::copy(child_file, dir.path + "/" + core);
         std::vector<std::string> steps = {"?child: 1 ", "!INT", "=0", "-child: 1 failed 13",
                                           "-child: 1 failed 22"};
         if (status == 13)
@@ -91,6 +86,6 @@ TEST(patterns_tool, explains_the_decision_torvad_makes) {
             steps.push_back("+a pattern could not be matched within");
         else if (r.explained.starts_with("refused: "))
             steps.push_back("+" + r.explained.substr(9, r.explained.find('\n') - 9));
-        run_scenario({"-d", dir.path}, steps, how);
+        run_scenario({"-d", dir.path}, steps);
     }
 }

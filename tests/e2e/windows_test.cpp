@@ -25,20 +25,16 @@ std::string windows_form(std::string path) {
     return "Z:" + path;
 }
 
-std::string windows_child() {
-    return std::string(std::getenv("TORVAD_WINDOWS_BUILD")) + "/tests/test_child.exe";
-}
-
 // A product directory ("my product", a blank in its path) with the test child
 // as core.exe, and a folder of tool stand-ins in front of PATH.
 struct installation {
     installation() {
         std::filesystem::create_directories(product() + "/scripts");
         std::filesystem::create_directories(root.path + "/bin");
-        std::filesystem::copy(windows_child(), product() + "/core.exe");
+        std::filesystem::copy(child_file, product() + "/core.exe");
     }
     void tool(const std::string& name) {
-        std::filesystem::copy(windows_child(), root.path + "/bin/" + name);
+        std::filesystem::copy(child_file, root.path + "/bin/" + name);
     }
     std::string product() const { return root.path + "/my product"; }
     std::string log(const std::string& name) const { return read_file(product() + "/" + name); }
@@ -157,7 +153,7 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
         std::string pid_file = dir.path + "/pid";
         std::string command = "\"" + torvad_binary + "\" -p " + pid_file + " -d " + dir.path;
         if (product) {
-            std::filesystem::copy(windows_child(), dir.path + "/core.exe");
+            std::filesystem::copy(child_file, dir.path + "/core.exe");
             std::ofstream{record};
         } else {
             command += " -- \"" + child_binary + "\" record " + record;
