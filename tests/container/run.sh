@@ -1,50 +1,30 @@
 #!/bin/sh
-# The image of `make image` under a real runtime: podman with runc, on a
-# storage folder of the test's own, and the Kubernetes manifest through
-# `podman kube play`. Ends with "N passed, N failed"; exit 1 on a failure, and
-# a podman that can't run the image is a failure. Leaves nothing behind.
+# The image of `make image` under podman with runc, on a store of the test's own,
+# and the Kubernetes manifest through `podman kube play`. Leaves nothing behind.
 #   tests/container/run.sh build/torvad-image.tar deploy/kubernetes/torvad.yaml
 set -u
 archive=$(realpath "$1") manifest=$(realpath "$2")
 here=$(dirname "$(realpath "$0")")
+. "$here/../lib.sh"
 store=$(mktemp -d /tmp/torvad-container.XXXXXX)
 touch "$store/started"
 cgroups=/sys/fs/cgroup/pids/libpod_parent
 [ -e "$cgroups" ] && cgroups= # podman's, if it made them: they go at the end
-passed=0 failed=0
 podman_sh=$here/../../packaging/container/podman.sh
 p() { "$podman_sh" "$store" "$@"; }
-
-check() { # description, then a command that must succeed
-    what=$1 && shift
-    if "$@" >/dev/null 2>&1; then passed=$((passed + 1)) && echo "ok   $what"
-    else failed=$((failed + 1)) && echo "FAIL $what"; fi
-}
-within() { # seconds, then a command
-    limit=$(($(date +%s) + $1)) && shift
-    until "$@" >/dev/null 2>&1; do
-        [ "$(date +%s)" -lt "$limit" ] || return 1
-        sleep 0.2
-    done
-}
 cleanup() {
     [ -n "${listener:-}" ] && kill "$listener" 2>/dev/null
-    p kube down "$manifest" >/dev/null 2>&1
-    p rm -af -t 0 >/dev/null 2>&1
-    p system reset -f >/dev/null 2>&1
-    rm -rf "$store"
-    tidy_cgroups
+    { p kube down "$manifest"; p rm -af -t 0; p system reset -f; } >/dev/null 2>&1
+    rm -rf "$store"; tidy_cgroups
 }
-tidy_cgroups() {
-    [ -n "$cgroups" ] && for tree in /sys/fs/cgroup/*/libpod_parent; do
-        find "$tree" -depth -type d -exec rmdir {} \; 2>/dev/null
-    done
-}
+tidy_cgroups() { [ -n "$cgroups" ] &&
+    find /sys/fs/cgroup/*/libpod_parent -depth -type d -exec rmdir {} \; 2>/dev/null; }
 trap cleanup EXIT
-now_ms() { echo $(($(date +%s%N) / 1000000)); }
+timed() { t=$(date +%s%N) && "$@" >/dev/null; took=$((($(date +%s%N) - t) / 1000000)); }
 logs_have() { p logs "$1" 2>&1 | grep -qF -- "$2"; }
-cores() { p top "$1" pid comm | awk '$2 == "core" { print $1 }'; }
+cores() { p top "$1" "${2:-pid}" comm | awk '$2 == "core" { print $1 }'; }
 one_core() { [ "$(cores "$1" | wc -l)" = 1 ]; }
+one_new_core() { one_core demo && [ "$(cores demo)" != "$1" ]; }
 refusals() { [ "$(p logs "${2:-demo}" 2>&1 | grep -c 'refused with status 13')" = "$1" ]; }
 as_nobody() { p top "$1" user comm | awk 'NR > 1 && $1 != "nobody" { bad = 1 } $2 == "core" { core = 1 } END { exit bad || !core }'; }
 untouched() {
@@ -52,25 +32,21 @@ untouched() {
     [ -z "$(find /var/lib/containers /run/containers /run/libpod /etc/containers /etc/cni \
         /sys/fs/cgroup/*/libpod_parent -newer "$store/started" 2>/dev/null)" ]
 }
-one_new_core() { one_core demo && [ "$(cores demo)" != "$1" ]; }
 orphans_with_torvad() { p top demo ppid comm | grep -q '^1 *busybox'; }
 no_zombie_no_orphan() { ! p top demo state comm | grep -Eq '^Z|busybox'; }
-ordered_stop() { # container: what an orderly end through sigterm leaves
+ordered_stop() { # what an orderly end through sigterm leaves
     logs_have "$1" "stopping torvad version" && logs_have "$1" "core: asked to stop, ending cleanly" &&
         logs_have "$1" "'core' exited with 0x0." && [ "$(p inspect -f '{{.State.ExitCode}}' "$1")" = 0 ]
 }
 
 image=$(tar -xOf "$archive" index.json | sed -n 's/.*"org.opencontainers.image.ref.name":"\([^"]*\)".*/\1/p')
-if ! p load -q -i "$archive" >/dev/null || ! p run --rm "$image" -h 2>&1 | grep -q "torvad version"; then
-    echo "FAIL podman loads and runs the image"
-    echo "0 passed, 1 failed"
-    exit 1
-fi
+p load -q -i "$archive" >/dev/null && p run --rm "$image" -h 2>&1 | grep -q "torvad version" ||
+    give_up "podman loads and runs the image"
 check "podman loads and runs $image" true
 
-# READY=1 reaches the caller's NOTIFY_SOCKET only through torvad. At that
-# moment the listener notes each core's grandparent: conmon, for a core run by
-# the container's own first process.
+# READY=1 reaches the caller's NOTIFY_SOCKET only through torvad. At that moment
+# the listener notes each core's grandparent: conmon, for a core run by the
+# container's own first process.
 perl -MSocket -e 'socket(S, PF_UNIX, SOCK_DGRAM, 0) && bind(S, pack_sockaddr_un($ARGV[0])) || die;
     sub proc { open(my $f, "/proc/$_[0]/$_[1]") or return ""; local $/; <$f> }
     sub parent { (split / /, proc($_[0], "stat") =~ s/.*\) //sr)[1] }
@@ -98,14 +74,11 @@ check "a burst of orphans goes to torvad" orphans_with_torvad
 check "no zombie is left after the burst" within 10 no_zombie_no_orphan
 
 old=$(cores demo)
-kill -9 "$(p top demo hpid comm | awk '$2 == "core" { print $1 }')"
+kill -9 "$(cores demo hpid)"
 check "kill -9 of core: one new core" within 10 one_new_core "$old"
 sleep 1
 check "kill -9 of core: still one core a second later" one_core demo
-
-started=$(now_ms)
-p stop -t 10 demo >/dev/null
-took=$(($(now_ms) - started))
+timed p stop -t 10 demo
 check "podman stop: core ends through sigterm, exit 0" ordered_stop demo
 check "podman stop: well within the grace period ($took ms)" test "$took" -lt 5000
 
@@ -120,9 +93,8 @@ check "unreadable exec.patterns: every request refused" within 10 refusals 3 clo
 p stop -t 10 closed >/dev/null
 check "unreadable exec.patterns: the stop is still orderly" ordered_stop closed
 
-# The manifest as a cluster takes it, stopped the way the kubelet stops a pod:
-# SIGTERM, and SIGKILL only after the grace period. (podman's `kube down`
-# alone kills at once, so the pod is stopped first.)
+# Stopped the way the kubelet stops a pod: SIGTERM, and SIGKILL only after the
+# grace period (podman's `kube down` alone kills at once).
 grace=$(sed -n 's/^ *terminationGracePeriodSeconds: *\([0-9]*\).*/\1/p' "$manifest")
 check "kube play runs the manifest unchanged" p kube play "$manifest"
 pod=$(p pod ps -q)
@@ -130,9 +102,7 @@ ctr=$(p ps --filter "pod=$pod" --format '{{.Names}}' | grep -v -- -infra)
 check "kube: core runs, relayed as before" within 10 logs_have "$ctr" "core: 'uname -sr' says: Linux"
 check "kube: torvad and core run as nobody" as_nobody "$ctr"
 check "kube: on a read-only root" test "$(p inspect -f '{{.HostConfig.ReadonlyRootfs}}' "$ctr")" = true
-started=$(now_ms)
-p pod stop -t "$grace" "$pod" >/dev/null
-took=$(($(now_ms) - started))
+timed p pod stop -t "$grace" "$pod"
 check "kube: core ends through sigterm, exit 0 ($took ms of ${grace} s)" ordered_stop "$ctr"
 check "kube down removes the pod" p kube down "$manifest"
 
@@ -141,5 +111,4 @@ check "no container and no pod is left" test -z "$(p ps -aq)$(p pod ps -q)"
 p rmi -af >/dev/null 2>&1
 check "no image is left" test -z "$(p images -aq)"
 check "the machine's own podman store and cgroups are as they were" untouched
-echo "$passed passed, $failed failed"
-[ "$failed" -eq 0 ]
+summary
