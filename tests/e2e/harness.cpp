@@ -130,6 +130,7 @@ const std::vector<std::string> tool_command =
     windows_build ? std::vector<std::string>{"/usr/bin/wine",
                                              std::string(windows_build) + "/torvad-patterns.exe"}
                   : std::vector<std::string>{TORVAD_PATTERNS_BINARY};
+const std::string torvad_name = windows_build ? "torvad.exe" : "torvad";
 const int event_wait_ms = under_wine ? 30000 : 10000;
 
 bool holds_here(systems where) {

@@ -16,6 +16,8 @@ extern const bool under_wine;
 // the command that runs torvad-patterns, as this system names them.
 extern const std::string torvad_binary, child_binary, child_file;
 extern const std::vector<std::string> tool_command;
+// The name that torvad's version packet gives it: its executable's.
+extern const std::string torvad_name;
 // The bound of a wait for an event: 10 s, and 30 s under Wine, which moves
 // every byte of a pipe through its server.
 extern const int event_wait_ms;

@@ -151,12 +151,14 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
         std::string name = "torvad_test_" + std::to_string(getpid());
         std::string record = dir.path + (product ? "/core.log" : "/child.log");
         std::string pid_file = dir.path + "/pid";
-        std::string command = "\"" + torvad_binary + "\" -p " + pid_file + " -d " + dir.path;
+        // A service starts elsewhere than on drive Z:.
+        std::string command = "\"" + torvad_binary + "\" -p " + windows_form(pid_file) + " -d " +
+                              windows_form(dir.path);
         if (product) {
             std::filesystem::copy(child_file, dir.path + "/core.exe");
             std::ofstream{record};
         } else {
-            command += " -- \"" + child_binary + "\" record " + record;
+            command += " -- \"" + child_binary + "\" record " + windows_form(record);
         }
         // Wine's sc tells a success by its exit code alone.
         int created = 1;
