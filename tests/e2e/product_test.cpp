@@ -17,7 +17,7 @@ using namespace e2e;
 // The status text follows the state, naming the persistent children.
 TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
     if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux\'s";
+        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
     const char* const running_0 = "@READY=1\nSTATUS=running, 0 children";
     const char* const running_1 = "@READY=1\nSTATUS=running, 1 child";
     const char* const stopping_0 = "@STOPPING=1\nSTATUS=stopping, waiting for 0 children";
@@ -102,7 +102,7 @@ const char* const core_ran = "?core runs as";
 
 TEST(product, server_family_start_takes_core_account_from_init_script) {
     if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux\'s";
+        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
     struct row {
         const char* init_script; // the body of the powershell stub; null: none on PATH
         std::vector<std::string> steps;
@@ -146,7 +146,7 @@ TEST(product, server_family_start_takes_core_account_from_init_script) {
 // service is handed over to it and torvad ends with 1, its PID file left.
 TEST(product, silent_core_hands_the_service_over_and_ends_with_1) {
     if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux\'s";
+        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
     const char* const silent_core = "echo 'usage: core' >&2; head -c 3000000 /dev/zero >&2";
     for (bool task_scheduler : {true, false}) {
         SCOPED_TRACE(task_scheduler ? "schtasks" : "systemd-run");
@@ -186,7 +186,7 @@ TEST(product, silent_core_hands_the_service_over_and_ends_with_1) {
 // report from inside shows.
 TEST(product, the_working_directory_decides_what_is_supervised) {
     if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux\'s";
+        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
     struct row {
         std::vector<std::string> programs, steps;
         bool needs_root = false;
