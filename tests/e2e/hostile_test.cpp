@@ -56,7 +56,7 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {},
          systems::linux_only},
         // a peer that floods a child's stdin that is never read
-        {child({"flood-in", child_binary, "sleep", "3s"}),
+        {child({"flood-in", child_binary, "exit", "0", "3s"}),
          {"?child: flood-in held", "M96", "!INT", "=0"}},
         // input for a child that closed its stdin is dropped, and holds nothing back
         {{"--", child_binary, "flood-in", "/bin/sh", "-c", "exec sleep 3 0<&-"},
