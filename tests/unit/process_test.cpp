@@ -63,9 +63,12 @@ struct packet {
 // The peer's end: a requester process serves the other one.
 class peer_pipe {
   public:
-    explicit peer_pipe(fake_owner& owner) {
+    // send_buffer, when given, bounds what torvad's end of the socket holds.
+    explicit peer_pipe(fake_owner& owner, int send_buffer = 0) {
         int ends[2];
         EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);
+        if (send_buffer != 0)
+            setsockopt(ends[1], SOL_SOCKET, SO_SNDBUF, &send_buffer, sizeof send_buffer);
         fd_ = ends[0];
         requester = process::create(owner, {{"peer"}, "", ".", true, stdio_inherit});
         requester->attach(1, ends[1]);
@@ -161,18 +164,20 @@ TEST(process, a_channel_ends_after_its_output_and_frees_its_id_at_once) {
 }
 
 // A requester that doesn't read holds its channel's output back: the child
-// blocks on its full pipe instead of torvad holding megabytes, and once the
-// peer reads again every byte arrives, in order, before closed.
+// blocks on its full pipe instead of torvad holding megabytes. A child that
+// ended meanwhile, its last output still in its pipe, has that sent too. Once
+// the peer reads again every byte arrives, in order, before closed.
 TEST(process, output_waits_for_a_requester_that_does_not_read) {
-    fake_owner owner;
-    peer_pipe peer(owner);
-    const std::size_t size = 4 << 20;
-    peer.execute(1, execute_stdio_pipes,
-                 "head -c " + std::to_string(size) + " /dev/zero | tr '\\0' x");
-    owner.context.run_for(std::chrono::milliseconds(500));
-    EXPECT_TRUE(owner.ended.empty()) << "the whole output was taken while nobody read it";
-    ASSERT_TRUE(peer.read_until(1, packet_closed));
-    EXPECT_EQ(peer.story(1), opened_closed(std::string(size, 'x')));
+    for (auto [size, ends_unread] : {std::pair{std::size_t(1) << 20, false}, {300u << 10, true}}) {
+        fake_owner owner;
+        peer_pipe peer(owner, 4096);
+        peer.execute(1, execute_stdio_pipes,
+                     "head -c " + std::to_string(size) + " /dev/zero | tr '\\0' x");
+        owner.context.run_for(std::chrono::milliseconds(500));
+        EXPECT_EQ(owner.ended.size(), ends_unread ? 1u : 0u) << size;
+        ASSERT_TRUE(peer.read_until(1, packet_closed));
+        EXPECT_TRUE(peer.story(1) == opened_closed(std::string(size, 'x'))) << size;
+    }
 }
 
 // What the owner hears of each end (the exit status, 128 + a signal), and a
