@@ -141,9 +141,8 @@ int mode_close_ipc(const context& how) {
 }
 
 // Sends one execute per request, on channels 1, 2, ...; each request is its
-// flags, then its items, and "+" separates requests. "<text" instead sends
-// text to the last request's stdin, and "!rmcwd" removes the working
-// directory; everything between two "!rmcwd" goes out in one write, as a peer
+// flags, then its items, and "+" separates requests. "!rmcwd" instead removes
+// the working directory; everything between two "!rmcwd" goes out in one write, as a peer
 // that pipelines sends it. Reports each opened, stdout and end per channel.
 // Led by "once MARKER OPENS", the first time (no MARKER yet) it waits for
 // OPENS opened packets instead and exits 3, leaving its channels behind;
@@ -155,11 +154,6 @@ int mode_execute(const context& how) {
     connection link(how.ipc_fd);
     greet(link);
     std::string batch;
-    auto add = [&](std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                   const std::string& payload) {
-        auto block = encode_packet(channel, type, flags, payload.data(), payload.size());
-        batch.append(block.begin(), block.end());
-    };
     auto flush = [&] {
         if (!batch.empty())
             peer::write_link(how.ipc_fd, batch.data(), batch.size());
@@ -175,14 +169,15 @@ int mode_execute(const context& how) {
             continue;
         }
         std::error_code error;
-        if (request.size() == 1 && request[0] == "!rmcwd") {
+        if (request == std::vector<std::string>{"!rmcwd"}) {
             flush();
             say("rmcwd %d", fs::remove(fs::current_path(), error) ? 0 : -1);
-        } else if (request.size() == 1 && request[0].starts_with('<')) {
-            add(channel, packet_stdin, 0, request[0].substr(1));
         } else if (request.size() > 1) {
-            add(++channel, packet_execute, static_cast<std::uint32_t>(std::stoul(request[0])),
-                join_strings({request.begin() + 1, request.end()}));
+            std::string items = join_strings({request.begin() + 1, request.end()});
+            auto block = encode_packet(++channel, packet_execute,
+                                       static_cast<std::uint32_t>(std::stoul(request[0])),
+                                       items.data(), items.size());
+            batch.append(block.begin(), block.end());
         }
         request.clear();
     }

@@ -87,24 +87,14 @@ TEST(children, a_requester_s_end_closes_the_pipes_of_its_channels) {
         GTEST_SKIP() << "runs cat and sh";
     scratch_dir dir;
     std::string once = "test -e " + dir.path + "/sh || { touch " + dir.path + "/sh; exit 3; }";
-    const std::vector<std::string> rows[] = {
-        // pipes
-        {"1", "2", "cat", "?'cat' exited with 0x0."},
-        // persistent and pipes, restarted once
-        {"2", "3", "sh", "-c", once + "; exec cat", "+starting 'sh' again.",
-         "?'sh' exited with 0x0."},
-    };
-    for (const auto& r : rows) {
-        SCOPED_TRACE(::testing::PrintToString(r));
-        auto end = std::find_if(r.begin(), r.end(),
-                                [](const auto& s) { return s[0] == '?' || s[0] == '+'; });
-        std::vector<std::string> mode = {"execute", "once", dir.path + "/left-" + r[2]};
-        mode.insert(mode.end(), r.begin(), end);
-        std::vector<std::string> steps = {"?child: left", "?starting 'test_child' again."};
-        steps.insert(steps.end(), end, r.end());
-        steps.insert(steps.end(), {"!INT", "=0"});
-        run_scenario(child(mode), steps);
-    }
+    const char* const left[] = {"?child: left", "?starting 'test_child' again."};
+    // pipes; then persistent and pipes, restarted once
+    run_scenario(child({"execute", "once", dir.path + "/left-cat", "1", "2", "cat"}),
+                 {left[0], left[1], "?'cat' exited with 0x0.", "!INT", "=0"});
+    run_scenario(
+        child(
+            {"execute", "once", dir.path + "/left-sh", "2", "3", "sh", "-c", once + "; exec cat"}),
+        {left[0], left[1], "+starting 'sh' again.", "?'sh' exited with 0x0.", "!INT", "=0"});
 }
 
 // A channel outlives its requester; at the stop it has no living parent, so

@@ -41,8 +41,6 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {"?failed to create child process.", "?failed 24", "!INT", "=0"},
          {.fd_limit = 64},
          systems::linux_only},
-        {requests({"2", missing, "+", "<lost"}),
-         {"?child: 1 failed 2", "&channel 0x1 does not exist", "!INT", "=0"}},
         // a working directory deleted under us: only a relative name is not found
         {{"-d", doomed.path, "--", child_binary, "execute", "!rmcwd", "+", "0", "./prog", "+", "0",
           "/bin/true", "+", "0", "true"},

@@ -24,9 +24,7 @@ TEST(codec, split_strings_gives_separators_plus_one_items) {
     };
     for (const auto& r : rows) {
         EXPECT_EQ(split_strings(r.data.data(), r.data.size(), '\0'), r.items);
-        if (!r.data.empty()) {
-            EXPECT_EQ(join_strings(r.items), r.data);
-        }
+        EXPECT_EQ(join_strings(r.items), r.data);
     }
     // Nothing at or behind data + size is read: the NUL there would add an item.
     const char bounded[] = {'a', 'b', '\0', 'c'};

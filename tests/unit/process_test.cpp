@@ -152,6 +152,7 @@ TEST(process, a_channel_ends_after_its_output_and_frees_its_id_at_once) {
     fake_owner owner;
     peer_pipe peer(owner);
     peer.send(1, packet_execute, 0, join_strings({"/no/such/program"}));
+    peer.send(1, packet_stdin, 0, "lost"); // a failed request leaves no channel behind
     peer.execute(2, execute_stdio_pipes, "printf out; printf err >&2; exit 3");
     ASSERT_TRUE(peer.read_until(2, packet_closed));
     ASSERT_GE(peer.packets.size(), 2u);
@@ -161,6 +162,7 @@ TEST(process, a_channel_ends_after_its_output_and_frees_its_id_at_once) {
     peer.execute(1, execute_stdio_pipes, "printf again");
     ASSERT_TRUE(peer.read_until(1, packet_closed));
     EXPECT_EQ(peer.story(1), "<failed:2>" + opened_closed("again"));
+    EXPECT_EQ(std::count(owner.log.begin(), owner.log.end(), "channel 0x1 does not exist"), 1);
 }
 
 // A requester that doesn't read holds its channel's output back: the child
