@@ -8,7 +8,6 @@
 #include "peer/link.hpp"
 #include "peer/peer.hpp"
 #include "tests/e2e/harness.hpp"
-#include "tests/packet_hex.hpp"
 
 using namespace e2e;
 
@@ -44,9 +43,8 @@ TEST(ipc, an_attached_pipe_is_served_until_the_peer_closes_it) {
     EXPECT_TRUE(run.wait_for("channel 0x7 does not exist"));
 
     // A program the peer has run doesn't hold the pipe: it can't speak on it as torvad.
-    std::string forged = hex_packet(9, torvad::packet_stdout, 0, "forged");
     ASSERT_TRUE(ours.execute(1, torvad::execute_stdio_none,
-                             {child_binary, "raw", forged, std::to_string(their_end)}));
+                             {child_binary, "forge", std::to_string(their_end)}));
     do
         ASSERT_TRUE(ours.receive(packet) && packet.header.channel != 9) << run.output();
     while (packet.header.type != torvad::packet_closed);
