@@ -131,13 +131,6 @@ int mode_forge(const context& how) {
     return peer::write_link(how.ipc_fd, packet.data(), packet.size()) ? 0 : 1;
 }
 
-int mode_close_ipc(const context& how) {
-    peer::close_link(how.ipc_fd);
-    say("closed ipc pid=%d", getpid());
-    std::this_thread::sleep_for(std::chrono::seconds(30));
-    return 0;
-}
-
 // Sends one execute per request, on channels 1, 2, ...; each request is its
 // flags, then its items, and "+" separates requests. "!rmcwd" instead removes
 // the working directory; everything between two "!rmcwd" goes out in one write, as a peer
@@ -265,7 +258,6 @@ const std::pair<const char*, int (*)(const context&)> modes[] = {
     {"fds", mode_fds},
     {"record", mode_record},
     {"forge", mode_forge},
-    {"close-ipc", mode_close_ipc},
     {"execute", mode_execute},
     {"flood-in", mode_flood_in},
     {"orphans", mode_orphans},

@@ -52,8 +52,8 @@ TEST(children, launch_exit_restart_and_stop) {
           "&still waiting for 'test_child' (pid ", "?child: second sigterm",
           "?'test_child' exited with 0x89.", "=0", "-again"}},
         // writing to a peer that closed its end must not kill us
-        {child({"close-ipc"}),
-         {"#closed ipc pid", "!INT", stopping, "kill 15", "?'test_child' exited with 0x8f.", "=0"},
+        {{"--", "/bin/sh", "-c", "exec 3>&-; echo closed ipc pid=$$; exec sleep 30"},
+         {"#closed ipc pid", "!INT", stopping, "kill 15", "?'sh' exited with 0x8f.", "=0"},
          false,
          systems::linux_only},
         // a child holds fds 0, 1, 2 and its ipc end only, with default signals
