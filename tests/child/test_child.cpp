@@ -50,6 +50,7 @@ struct context {
     const char* self;
     std::vector<std::string> args; // behind the mode, without the ipc fd
     int ipc_fd = -1;
+    std::string mode = "";
     int number(std::size_t i) const { return i < args.size() ? std::atoi(args[i].c_str()) : 0; }
 };
 
@@ -92,6 +93,10 @@ int serve(const context& how, bool deaf = false) {
         return 0;
     connection link(how.ipc_fd);
     return greet(link) ? await_sigterm(link, deaf) : 5;
+}
+
+int mode_peer(const context& how) {
+    return serve(how, how.mode == "ignore-sigterm");
 }
 
 // A peer whose report goes to the file FILE, for a run with no console to
@@ -247,14 +252,8 @@ int mode_orphans(const context& how) {
 
 const std::pair<const char*, int (*)(const context&)> modes[] = {
     {"exit", mode_exit},
-    {"peer",
-     [](const context& how) {
-         return serve(how);
-     }},
-    {"ignore-sigterm",
-     [](const context& how) {
-         return serve(how, true);
-     }},
+    {"peer", mode_peer},
+    {"ignore-sigterm", mode_peer},
     {"fds", mode_fds},
     {"record", mode_record},
     {"forge", mode_forge},
@@ -301,8 +300,9 @@ int main(int argc, char** argv) {
         return mode_fds(how);
     for (int i = 2; i < (how.ipc_fd >= 0 ? argc - 1 : argc); ++i)
         how.args.emplace_back(argv[i]);
+    how.mode = argc > 1 ? argv[1] : "";
     for (const auto& [name, run] : modes)
-        if (argc > 1 && std::strcmp(argv[1], name) == 0)
+        if (how.mode == name)
             return run(how);
     std::fprintf(stderr, "usage: test_child <mode> [args...] [ipc fd]\n");
     return 64;

@@ -7,21 +7,12 @@
 
 using namespace e2e;
 
-namespace {
-
-std::vector<std::string> requests(std::vector<std::string> args) {
-    args.insert(args.begin(), "execute");
-    return child(args);
-}
-
-} // namespace
-
 TEST(hostile, faults_leave_the_supervisor_serving) {
     scratch_dir dir, doomed;
     const std::string pipes = "2";
     // Not there on either system, in a folder that is: "not found" on both.
     const std::string missing = dir.path + "/no_such_prog";
-    std::vector<std::string> many_channels;
+    std::vector<std::string> many_channels = {"execute"};
     for (int i = 0; i < 40; ++i)
         many_channels.insert(many_channels.end(), {pipes, "/bin/sleep", "1", "+"});
     struct row {
@@ -31,13 +22,13 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
     };
     const row rows[] = {
         // refusals carry their statuses: malformed, not permitted, not found
-        {requests({"8", "only", "+", "0", "", "+", "8", "someone_else", "/bin/true", "+", "0",
-                   "no_such_program_xyz"}),
+        {child({"execute", "8", "only", "+", "0", "", "+", "8", "someone_else", "/bin/true", "+",
+                "0", "no_such_program_xyz"}),
          {"&user not specified", "&executable not specified", "&permission to change user denied",
           "&executable 'no_such_program_xyz' not found.", "?child: 1 failed 22",
           "?child: 2 failed 22", "?child: 3 failed 13", "?child: 4 failed 2", "!INT", "=0"}},
         // out of descriptors: launches fail with the errno, the daemon serves on
-        {requests(many_channels),
+        {child(many_channels),
          {"?failed to create child process.", "?failed 24", "!INT", "=0"},
          {.fd_limit = 64},
          systems::linux_only},
@@ -49,7 +40,7 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {},
          systems::linux_only}, // Windows keeps a process's working directory
         // a grandchild holding the pipe does not hold back the channel's end (past the wait)
-        {requests({pipes, "/bin/sh", "-c", "sleep 12 & echo hi"}),
+        {child({"execute", pipes, "/bin/sh", "-c", "sleep 12 & echo hi"}),
          {"?child: 1 stdout hi", "?child: 1 closed 0", "!INT", "=0"},
          {},
          systems::linux_only},
@@ -85,13 +76,13 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {},
          systems::windows_only},
         // each item reaches the program whole: none of it can become an argument of its own
-        {requests({pipes, child_binary, "args", "a\\\" --delete-all", "C:\\dir\\", "x y",
-                   "\\\\\"q\\", "", "t\tab", "\"", "\\", "\xc3\xa9\xe2\x82\xac", "end"}),
+        {child({"execute", pipes, child_binary, "args", "a\\\" --delete-all", "C:\\dir\\", "x y",
+                "\\\\\"q\\", "", "t\tab", "\"", "\\", "\xc3\xa9\xe2\x82\xac", "end"}),
          {"?child: 1 stdout child: args [a\\\" --delete-all][C:\\dir\\][x y][\\\\\"q\\][]"
           "[t\\x09ab][\"][\\][\\xc3\\xa9\\xe2\\x82\\xac][end]\n",
           "!INT", "=0"}},
         // a batch file would have cmd.exe read its arguments: refused, by any spelling
-        {requests({"0", missing + ".bat", "+", "0", missing + ".CmD. "}),
+        {child({"execute", "0", missing + ".bat", "+", "0", missing + ".CmD. "}),
          {"?refused to run '", "?child: 1 failed 193", "?child: 2 failed 193", "!INT", "=0"},
          {},
          systems::windows_only},
