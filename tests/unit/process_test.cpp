@@ -6,6 +6,8 @@
 #include <chrono>
 #include <fstream>
 #include <functional>
+#include <linux/sockios.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -78,6 +80,13 @@ class peer_pipe {
 
     void write_bytes(const std::string& bytes) {
         ASSERT_EQ(write(fd_, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+    }
+    // Runs the loop until torvad has read every byte written so far (bounded).
+    void let_read() {
+        int unread = 1;
+        for (int turns = 0; turns < 2000 && ioctl(fd_, SIOCOUTQ, &unread) == 0 && unread > 0;
+             ++turns)
+            owner_->context.run_for(std::chrono::milliseconds(1));
     }
     void send(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
               const std::string& payload) {
@@ -276,7 +285,7 @@ TEST(process, packets_are_framed_across_reads_and_traced) {
         owner.log.clear();
         for (const auto& piece : pieces) {
             peer.write_bytes(piece);
-            owner.context.run_for(std::chrono::milliseconds(20));
+            peer.let_read();
         }
         peer.requester->terminate();
         auto expected = lines;
