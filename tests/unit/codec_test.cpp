@@ -1,9 +1,10 @@
 // String lists, quoting and packet bytes, against known byte sequences.
 #include <gtest/gtest.h>
 
+#include <tuple>
+
 #include "ipc/packet.hpp"
 #include "ipc/strings.hpp"
-#include "tests/packet_hex.hpp"
 
 using namespace torvad;
 
@@ -24,9 +25,7 @@ TEST(codec, split_strings_gives_separators_plus_one_items) {
     };
     for (const auto& r : rows) {
         EXPECT_EQ(split_strings(r.data.data(), r.data.size(), '\0'), r.items);
-        if (!r.data.empty()) {
-            EXPECT_EQ(join_strings(r.items), r.data);
-        }
+        EXPECT_EQ(join_strings(r.items), r.data);
     }
     // Nothing at or behind data + size is read: the NUL there would add an item.
     const char bounded[] = {'a', 'b', '\0', 'c'};
@@ -59,14 +58,14 @@ TEST(codec, packets_match_their_bytes) {
     };
     for (const auto& r : rows) {
         auto framed = encode_packet(r.channel, r.type, r.flags, r.payload.data(), r.payload.size());
-        std::string expected = r.hex;
+        std::string expected = r.hex, hex;
         std::erase(expected, ' ');
-        EXPECT_EQ(hex_packet(r.channel, r.type, r.flags, r.payload), expected);
+        for (unsigned char byte : framed)
+            hex += {"0123456789abcdef"[byte >> 4], "0123456789abcdef"[byte & 15]};
+        EXPECT_EQ(hex, expected);
         packet_header header = read_packet_header(framed.data());
-        EXPECT_EQ(header.length, framed.size());
-        EXPECT_EQ(header.channel, r.channel);
-        EXPECT_EQ(header.type, r.type);
-        EXPECT_EQ(header.flags, r.flags);
+        EXPECT_EQ(std::tuple(header.length, header.channel, header.type, header.flags),
+                  std::tuple(std::uint32_t(framed.size()), r.channel, r.type, r.flags));
     }
     for (auto [length, valid] :
          {std::pair{15u, false}, {16u, true}, {65536u, true}, {65537u, false}})

@@ -5,6 +5,9 @@
 #include <algorithm>
 #include <chrono>
 #include <fstream>
+#include <functional>
+#include <linux/sockios.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -32,7 +35,8 @@ struct fake_owner final : process_owner {
     }
     const pattern_lists& patterns() const override { return everything; }
     const run_facts& facts() const override { return run; }
-    void write_log(platform::event_type, const char*) override {}
+    std::vector<std::string> log;
+    void write_log(platform::event_type, const char* text) override { log.emplace_back(text); }
 
     // As the daemon's shutdown: nothing outlives the loop.
     ~fake_owner() {
@@ -44,6 +48,15 @@ struct fake_owner final : process_owner {
     }
 };
 
+// length, when given, replaces the true length field: a lie for the framer.
+std::string packet_bytes(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                         const std::string& payload, std::uint32_t length = 0) {
+    auto bytes = encode_packet(channel, type, flags, payload.data(), payload.size());
+    if (length != 0)
+        store_u32(reinterpret_cast<unsigned char*>(bytes.data()), length);
+    return {bytes.begin(), bytes.end()};
+}
+
 struct packet {
     std::uint32_t channel, type, flags;
     std::string payload;
@@ -52,9 +65,12 @@ struct packet {
 // The peer's end: a requester process serves the other one.
 class peer_pipe {
   public:
-    explicit peer_pipe(fake_owner& owner) {
+    // send_buffer, when given, bounds what torvad's end of the socket holds.
+    explicit peer_pipe(fake_owner& owner, int send_buffer = 0) {
         int ends[2];
         EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);
+        if (send_buffer != 0)
+            setsockopt(ends[1], SOL_SOCKET, SO_SNDBUF, &send_buffer, sizeof send_buffer);
         fd_ = ends[0];
         requester = process::create(owner, {{"peer"}, "", ".", true, stdio_inherit});
         requester->attach(1, ends[1]);
@@ -62,10 +78,19 @@ class peer_pipe {
     }
     ~peer_pipe() { close(fd_); }
 
+    void write_bytes(const std::string& bytes) {
+        ASSERT_EQ(write(fd_, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+    }
+    // Runs the loop until torvad has read every byte written so far (bounded).
+    void let_read() {
+        int unread = 1;
+        for (int turns = 0; turns < 2000 && ioctl(fd_, SIOCOUTQ, &unread) == 0 && unread > 0;
+             ++turns)
+            owner_->context.run_for(std::chrono::milliseconds(1));
+    }
     void send(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
               const std::string& payload) {
-        auto bytes = encode_packet(channel, type, flags, payload.data(), payload.size());
-        ASSERT_EQ(write(fd_, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+        write_bytes(packet_bytes(channel, type, flags, payload));
     }
     void execute(std::uint32_t channel, std::uint32_t flags, const std::string& shell_line) {
         send(channel, packet_execute, flags, join_strings({"/bin/sh", "-c", shell_line}));
@@ -73,6 +98,13 @@ class peer_pipe {
     // Runs the loop until count packets of type on channel have come
     // (bounded), keeping every packet but the version.
     bool read_until(std::uint32_t channel, std::uint32_t type, long count = 1) {
+        return read_until([&] {
+            return std::count_if(packets.begin(), packets.end(), [&](const packet& p) {
+                       return p.channel == channel && p.type == type;
+                   }) >= count;
+        });
+    }
+    bool read_until(const std::function<bool()>& done) {
         auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
         while (std::chrono::steady_clock::now() < deadline) {
             owner_->context.run_for(std::chrono::milliseconds(5));
@@ -90,20 +122,23 @@ class peer_pipe {
                 if (header.type != packet_version)
                     packets.push_back({header.channel, header.type, header.flags, payload});
             }
-            if (std::count_if(packets.begin(), packets.end(), [&](const packet& p) {
-                    return p.channel == channel && p.type == type;
-                }) >= count)
+            if (done())
                 return true;
         }
         return false;
     }
-    // What came on channel: its output as text, the rest by type name.
+    // What came on channel: its output as text, the rest by type name, an
+    // end with its status.
     std::string story(std::uint32_t channel) const {
         std::string text;
         for (const auto& p : packets)
-            if (p.channel == channel)
-                text += p.type <= packet_stderr ? p.payload
-                                                : std::string("<") + packet_type_name(p.type) + ">";
+            if (p.channel != channel)
+                continue;
+            else if (p.type <= packet_stderr)
+                text += p.payload;
+            else
+                text += std::string("<") + packet_type_name(p.type) +
+                        (p.type == packet_opened ? "" : ":" + std::to_string(p.flags)) + ">";
         return text;
     }
 
@@ -116,8 +151,8 @@ class peer_pipe {
     std::string buffer_;
 };
 
-std::string opened_closed(const std::string& between) {
-    return "<opened>" + between + "<closed>";
+std::string opened_closed(const std::string& between, int status = 0) {
+    return "<opened>" + between + "<closed:" + std::to_string(status) + ">";
 }
 
 // Pipelined requests end in the order asked, output ahead of the end, and an
@@ -126,31 +161,34 @@ TEST(process, a_channel_ends_after_its_output_and_frees_its_id_at_once) {
     fake_owner owner;
     peer_pipe peer(owner);
     peer.send(1, packet_execute, 0, join_strings({"/no/such/program"}));
+    peer.send(1, packet_stdin, 0, "lost"); // a failed request leaves no channel behind
     peer.execute(2, execute_stdio_pipes, "printf out; printf err >&2; exit 3");
     ASSERT_TRUE(peer.read_until(2, packet_closed));
     ASSERT_GE(peer.packets.size(), 2u);
     EXPECT_EQ(peer.packets[0].type, packet_failed);
     EXPECT_EQ(peer.packets[1].type, packet_opened);
-    EXPECT_EQ(peer.story(2), opened_closed("outerr"));
-    EXPECT_EQ(peer.packets.back().flags, 3u); // closed carries the exit status
+    EXPECT_EQ(peer.story(2), opened_closed("outerr", 3));
     peer.execute(1, execute_stdio_pipes, "printf again");
     ASSERT_TRUE(peer.read_until(1, packet_closed));
-    EXPECT_EQ(peer.story(1), "<failed>" + opened_closed("again"));
+    EXPECT_EQ(peer.story(1), "<failed:2>" + opened_closed("again"));
+    EXPECT_EQ(std::count(owner.log.begin(), owner.log.end(), "channel 0x1 does not exist"), 1);
 }
 
 // A requester that doesn't read holds its channel's output back: the child
-// blocks on its full pipe instead of torvad holding megabytes, and once the
-// peer reads again every byte arrives, in order, before closed.
+// blocks on its full pipe instead of torvad holding megabytes. A child that
+// ended meanwhile, its last output still in its pipe, has that sent too. Once
+// the peer reads again every byte arrives, in order, before closed.
 TEST(process, output_waits_for_a_requester_that_does_not_read) {
-    fake_owner owner;
-    peer_pipe peer(owner);
-    const std::size_t size = 4 << 20;
-    peer.execute(1, execute_stdio_pipes,
-                 "head -c " + std::to_string(size) + " /dev/zero | tr '\\0' x");
-    owner.context.run_for(std::chrono::milliseconds(500));
-    EXPECT_TRUE(owner.ended.empty()) << "the whole output was taken while nobody read it";
-    ASSERT_TRUE(peer.read_until(1, packet_closed));
-    EXPECT_EQ(peer.story(1), opened_closed(std::string(size, 'x')));
+    for (auto [size, ends_unread] : {std::pair{std::size_t(1) << 20, false}, {300u << 10, true}}) {
+        fake_owner owner;
+        peer_pipe peer(owner, 4096);
+        peer.execute(1, execute_stdio_pipes,
+                     "head -c " + std::to_string(size) + " /dev/zero | tr '\\0' x");
+        owner.context.run_for(std::chrono::milliseconds(500));
+        EXPECT_EQ(owner.ended.size(), ends_unread ? 1u : 0u) << size;
+        ASSERT_TRUE(peer.read_until(1, packet_closed));
+        EXPECT_TRUE(peer.story(1) == opened_closed(std::string(size, 'x'))) << size;
+    }
 }
 
 // What the owner hears of each end (the exit status, 128 + a signal), and a
@@ -168,7 +206,7 @@ TEST(process, the_owner_hears_each_end_and_restarts_in_place) {
     std::sort(owner.ended.begin(), owner.ended.end());
     EXPECT_EQ(owner.ended, (std::vector<std::uint32_t>{0, 5, 137}));
     // The successor opens before its predecessor's closed goes out.
-    EXPECT_EQ(peer.story(2), "<opened><opened><closed><closed>");
+    EXPECT_EQ(peer.story(2), "<opened><opened><closed:137><closed:0>");
     unlink(marker.c_str());
 }
 
@@ -193,6 +231,67 @@ TEST(process, a_stop_continues_a_child_the_terminal_stopped) {
     EXPECT_NE(child->description().find("stopped by the terminal"), std::string::npos);
     ASSERT_TRUE(peer.read_until(1, packet_closed));
     EXPECT_EQ(owner.ended, std::vector<std::uint32_t>{7});
+}
+
+// A channel's standard streams travel over its requester's pipe, in order and
+// in packets of one relayed read at most; stdin only reaches a channel with
+// pipes, and its close flag holds even when the queue had drained.
+TEST(process, a_channel_relays_its_standard_streams_in_order) {
+    fake_owner owner;
+    peer_pipe peer(owner);
+    std::string sent(10000, 'a');
+    for (std::size_t i = 0; i < sent.size(); ++i)
+        sent[i] = static_cast<char>('a' + i % 26);
+    peer.execute(7, execute_stdio_pipes, "cat; echo eof >&2");
+    peer.execute(8, execute_stdio_none, "sleep 1");
+    peer.send(7, packet_stdin, 0, sent.substr(0, 6000));
+    peer.send(7, packet_stdin, 0, sent.substr(6000));
+    peer.send(8, packet_stdin, 0, "nobody reads this");
+    ASSERT_TRUE(peer.read_until([&] { return peer.story(7) == "<opened>" + sent; }));
+    peer.send(7, packet_stdin, stdin_close, "tail");
+    ASSERT_TRUE(peer.read_until(7, packet_closed));
+    EXPECT_EQ(peer.story(7), opened_closed(sent + "tail" + "eof\n"));
+    std::string err;
+    for (const auto& p : peer.packets) {
+        EXPECT_LE(p.payload.size(), 4096u);
+        err += p.type == packet_stderr ? p.payload : "";
+    }
+    EXPECT_EQ(err, "eof\n");
+    EXPECT_EQ(owner.log, std::vector<std::string>{"channel 0x8 standard input is not available"});
+}
+
+// Bytes of packets split across reads and joined in one are framed in order;
+// a length that can't be trusted drops every byte held, whole packets too.
+// Each row's pieces reach the pipe in separate reads; under -v every packet
+// is traced.
+TEST(process, packets_are_framed_across_reads_and_traced) {
+    const std::string stdin5 = packet_bytes(5, packet_stdin, 0, "abc"),
+                      stdin6 = packet_bytes(6, packet_stdin, stdin_close, "x");
+    const std::pair<std::vector<std::string>, std::vector<std::string>> rows[] = {
+        {{stdin5 + stdin6},
+         {"<- peer:5 stdin abc", "channel 0x5 does not exist", "<- peer:6 stdin x flags=0x1",
+          "channel 0x6 does not exist"}},
+        {{stdin5.substr(0, 5), stdin5.substr(5, 12), stdin5.substr(17)},
+         {"<- peer:5 stdin abc", "channel 0x5 does not exist"}},
+        {{packet_bytes(7, packet_stdin, 0, "", 15) + stdin5, stdin6},
+         {"bad ipc packet length", "<- peer:6 stdin x flags=0x1", "channel 0x6 does not exist"}},
+        {{packet_bytes(0x500003, 9, 4, "zz") + packet_bytes(1, packet_sigterm, 0, "")},
+         {"<- peer:psfile:3 unknown ", "<- peer:1 sigterm "}},
+    };
+    for (const auto& [pieces, lines] : rows) {
+        fake_owner owner;
+        owner.run.verbose = true;
+        peer_pipe peer(owner);
+        owner.log.clear();
+        for (const auto& piece : pieces) {
+            peer.write_bytes(piece);
+            peer.let_read();
+        }
+        peer.requester->terminate();
+        auto expected = lines;
+        expected.push_back("-> peer:0 sigterm ");
+        EXPECT_EQ(owner.log, expected);
+    }
 }
 
 } // namespace
