@@ -14,13 +14,12 @@
 #include <fstream>
 #include <poll.h>
 #include <pty.h>
-#include <random>
 #include <sched.h>
-#include <sstream>
 #include <sys/ioctl.h>
 #include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/un.h>
 #include <sys/wait.h>
@@ -214,33 +213,46 @@ void daemon_run::interrupt_group() {
 
 bool daemon_run::wait_for(const std::string& text, int timeout_ms) {
     auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
-    for (;;) {
-        auto found = output_.find(text, cursor_);
-        if (found != std::string::npos) {
-            cursor_ = found + text.size();
-            return true;
-        }
+    std::size_t found;
+    while ((found = output_.find(text, cursor_)) == std::string::npos)
         if (!read_some(remaining_ms(deadline)) && (eof_ || remaining_ms(deadline) == 0))
             return false;
-    }
+    cursor_ = found + text.size();
+    return true;
 }
 
-bool daemon_run::wait_anywhere(const std::string& text, int timeout_ms) {
-    std::size_t kept = cursor_;
-    cursor_ = 0;
-    bool found = wait_for(text, timeout_ms);
+bool daemon_run::wait_anywhere(const std::string& text) {
+    std::size_t kept = std::exchange(cursor_, 0);
+    bool found = wait_for(text);
     cursor_ = kept;
     return found;
 }
 
-std::string daemon_run::wait_value(const std::string& key, int timeout_ms) {
-    if (!wait_for(key + "=", timeout_ms))
-        return {};
-    std::size_t end = output_.find_first_of(" \t\r\n", cursor_);
-    std::string value = output_.substr(cursor_, end - cursor_);
-    cursor_ = end == std::string::npos ? output_.size() : end;
-    return value;
+namespace {
+
+// A zombie is reaped by the loop's next turn; nothing tells us when that was.
+bool no_zombie_within(int pid, int timeout_ms) {
+    auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
+    for (;;) {
+        std::ifstream children("/proc/" + std::to_string(pid) + "/task/" + std::to_string(pid) +
+                               "/children");
+        int zombies = 0;
+        for (pid_t child; !under_wine && children >> child;)
+            zombies += read_file("/proc/" + std::to_string(child) + "/stat").find(") Z ") !=
+                       std::string::npos;
+        if (zombies == 0 || clock::now() > deadline)
+            return zombies == 0;
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
 }
+
+long peak_memory_kib(int pid) {
+    std::string status = read_file("/proc/" + std::to_string(pid) + "/status");
+    auto peak = status.find("VmHWM:");
+    return peak == std::string::npos ? -1 : std::atol(status.c_str() + peak + 6);
+}
+
+} // namespace
 
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
                   const options& how, const step_hook& hook) {
@@ -259,13 +271,11 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
         else if (step[0] == 'M')
             EXPECT_LT(peak_memory_kib(run.pid()), std::atoi(text.c_str()) * 1024);
         else if (step[0] == '#')
-            child = std::atoi(run.wait_value(text).c_str());
+            child = run.wait_for(text + "=") ? std::atoi(run.at_cursor()) : -1;
         else if (step.rfind("kill ", 0) == 0 && child > 0)
-            kill_process(child, std::atoi(step.c_str() + 5));
+            kill(child, std::atoi(step.c_str() + 5));
         else if (step[0] == '=')
             EXPECT_EQ(run.wait_exit(), std::atoi(text.c_str())) << run.output();
-        else if (step == "Z")
-            EXPECT_EQ(zombie_children(run.pid()), 0);
         else if (step == "z")
             EXPECT_TRUE(no_zombie_within(run.pid(), event_wait_ms)) << run.output();
         else if (step[0] == '&')
@@ -279,12 +289,19 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
     }
 }
 
-scratch_dir::scratch_dir() {
-    std::random_device random;
-    auto base = std::filesystem::temp_directory_path();
-    do
-        path = (base / ("torvad-test-" + std::to_string(random()))).generic_string();
-    while (!std::filesystem::create_directory(path));
+void run_rows(const std::vector<row>& rows) {
+    for (const auto& r : rows) {
+        if (!holds_here(r.where) || (r.needs_root && geteuid() != 0))
+            continue;
+        SCOPED_TRACE(::testing::PrintToString(r.args).substr(0, 200));
+        run_scenario(r.args, r.steps, r.how);
+    }
+}
+
+scratch_dir::scratch_dir() : path(std::filesystem::temp_directory_path() / "torvad-test-XXXXXX") {
+    // Open to all, as a service account's child may have to enter it.
+    if (mkdtemp(path.data()) == nullptr || chmod(path.c_str(), 0755) == -1)
+        std::abort();
 }
 
 scratch_dir::~scratch_dir() {
@@ -292,38 +309,31 @@ scratch_dir::~scratch_dir() {
     std::filesystem::remove_all(path, ignored);
 }
 
-notify_socket::notify_socket() : fd_(bound_datagram_socket(dir_.path + "/notify")) {}
+notify_socket::notify_socket() : fd(bound_datagram_socket(dir.path + "/notify")) {}
 
 notify_socket::~notify_socket() {
-    close(fd_);
+    close(fd);
 }
 
 std::string notify_socket::next(int timeout_ms) {
-    pollfd ready{fd_, POLLIN, 0};
+    pollfd ready{fd, POLLIN, 0};
     char message[256];
-    ssize_t got = poll(&ready, 1, timeout_ms) == 1 ? recv(fd_, message, sizeof message, 0) : 0;
+    ssize_t got = poll(&ready, 1, timeout_ms) == 1 ? recv(fd, message, sizeof message, 0) : 0;
     return std::string(message, got > 0 ? got : 0);
 }
 
-step_hook service_steps(notify_socket& manager) {
-    return [&manager](const std::string& step, daemon_run& run) {
+step_hook notify_socket::steps() {
+    return [this](const std::string& step, daemon_run& run) {
         if (step == "!USR2") {
-            run.signal(SIGUSR2);
+            kill(run.pid(), SIGUSR2);
         } else if (step == "@*") {
-            while (!manager.next(0).empty()) {
+            while (!next(0).empty()) {
             }
         } else if (step[0] == '@') {
-            EXPECT_EQ(manager.next(), step.substr(1)) << run.output();
+            EXPECT_EQ(next(), step.substr(1)) << run.output();
         }
         return step == "!USR2" || step[0] == '@';
     };
-}
-
-// The build's own copy serves under Wine: no account there is kept out of it.
-reachable_child::reachable_child() : path(under_wine ? child_binary : dir.path + "/test_child") {
-    std::filesystem::permissions(dir.path, std::filesystem::perms(0755));
-    if (!under_wine)
-        std::filesystem::copy(child_binary, path);
 }
 
 std::vector<std::string> child(std::vector<std::string> mode, std::vector<std::string> options) {
@@ -339,53 +349,7 @@ bool file_exists(const std::string& path) {
 
 std::string read_file(const std::string& path) {
     std::ifstream file(path, std::ios::binary);
-    std::stringstream text;
-    text << file.rdbuf();
-    return text.str();
-}
-
-void kill_process(int pid, int signal_number) {
-    kill(pid, signal_number);
-}
-
-long peak_memory_kib(int pid) {
-    std::string status = read_file("/proc/" + std::to_string(pid) + "/status");
-    auto peak = status.find("VmHWM:");
-    return peak == std::string::npos ? -1 : std::atol(status.c_str() + peak + 6);
-}
-
-int zombie_children(int pid) {
-    std::ifstream children("/proc/" + std::to_string(pid) + "/task/" + std::to_string(pid) +
-                           "/children");
-    int zombies = 0;
-    for (pid_t child; !under_wine && children >> child;)
-        zombies +=
-            read_file("/proc/" + std::to_string(child) + "/stat").find(") Z ") != std::string::npos;
-    return zombies;
-}
-
-// A zombie is reaped by the loop's next turn; nothing tells us when that was.
-bool no_zombie_within(int pid, int timeout_ms) {
-    auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
-    while (zombie_children(pid) != 0) {
-        if (clock::now() > deadline)
-            return false;
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return true;
-}
-
-bool running_as_root() {
-    return geteuid() == 0;
-}
-
-bool make_link_pair(int& ours, long& theirs) {
-    int fds[2];
-    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) == -1)
-        return false;
-    ours = fds[0];
-    theirs = fds[1];
-    return true;
+    return {std::istreambuf_iterator<char>(file), {}};
 }
 
 int bound_datagram_socket(const std::string& path) {

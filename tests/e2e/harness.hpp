@@ -10,34 +10,27 @@
 
 namespace e2e {
 
-// The Windows build under Wine, else this system's own.
 extern const bool under_wine;
-// torvad and the test child as torvad names them; the test child's file and
-// the command that runs torvad-patterns, as this system names them.
-extern const std::string torvad_binary, child_binary, child_file;
+// torvad and the test child as torvad names them; the name its version
+// packet gives it; the test child's file and the command of torvad-patterns
+// as this system names them.
+extern const std::string torvad_binary, child_binary, torvad_name, child_file;
 extern const std::vector<std::string> tool_command;
-// The name that torvad's version packet gives it: its executable's.
-extern const std::string torvad_name;
-// The bound of a wait for an event: 10 s, and 30 s under Wine, which moves
-// every byte of a pipe through its server.
+// The bound of a wait for an event; Wine moves every byte through its server.
 extern const int event_wait_ms;
 
-// Where a row of a table holds.
 enum class systems { both, linux_only, windows_only };
 bool holds_here(systems where);
 
 struct options {
     bool terminal = true;         // stdout and stderr on a terminal (a console), else a pipe
     long inherit = -1;            // one more fd the daemon keeps
-    std::vector<std::string> env; // NAME=value set in the environment (PATH too)
+    std::vector<std::string> env; // NAME=value set in the environment
     std::string directory;        // where it starts; empty: ours
-    // The start state a careless parent may leave: a low fd limit, stdin
-    // closed, SIGCHLD ignored.
+    // The start state a careless parent may leave.
     int fd_limit = 0;
-    bool close_stdin = false;
-    bool ignore_sigchld = false;
-    // A folder that the run sees as its /dev, in a mount namespace of its own
-    // (needs root); it should hold a file "null".
+    bool close_stdin = false, ignore_sigchld = false;
+    // A folder that the run sees as its /dev (needs root); it should hold "null".
     std::string dev;
 };
 
@@ -50,9 +43,7 @@ class daemon_run {
     // Reads until text appears behind the cursor; moves the cursor behind it.
     bool wait_for(const std::string& text, int timeout_ms = event_wait_ms);
     // Reads until text appears anywhere; the cursor stays where it was.
-    bool wait_anywhere(const std::string& text, int timeout_ms = event_wait_ms);
-    // The value behind "key=" in the next output that holds it, e.g. a pid.
-    std::string wait_value(const std::string& key, int timeout_ms = event_wait_ms);
+    bool wait_anywhere(const std::string& text);
     // The exit code, or -1 when it didn't end in time (it is killed then).
     int wait_exit(int timeout_ms = event_wait_ms);
     // A stop request: the signal on Linux, Ctrl-C typed at the console under Wine.
@@ -60,6 +51,7 @@ class daemon_run {
     // Ctrl-C as a terminal gives it: to torvad and whatever shares its terminal.
     void interrupt_group();
     int pid() const { return pid_; }
+    const char* at_cursor() const { return output_.c_str() + cursor_; }
     const std::string& output() const { return output_; }
 
   private:
@@ -75,15 +67,23 @@ class daemon_run {
 //   "?text" waits for text behind the last match    "!INT" / "!TERM" signals torvad
 //   "#key"  takes the pid behind "key=" as the child "kill N" sends signal N to it
 //   "=N"    expects exit code N                     "-text" text never appears
-//   "+text" text appears anywhere                    "Z" no child of torvad is a zombie
-//   "z"     within 10 s, no child of torvad is a zombie
-//   "&text" waits for text anywhere, cursor kept
+//   "+text" text appears anywhere                    "&text" waits for text anywhere
+//   "z"     within the bound, no child of torvad is a zombie
 //   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
 //   "M<n>"  torvad's peak memory stayed below n MiB
 // A test's own steps, tried before those above; true when it took the step.
 using step_hook = std::function<bool(const std::string& step, daemon_run& run)>;
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
                   const options& how = {}, const step_hook& hook = {});
+
+// A row of a scenario table; run_rows runs those that hold here.
+struct row {
+    std::vector<std::string> args, steps;
+    options how = {};
+    systems where = systems::both;
+    bool needs_root = false;
+};
+void run_rows(const std::vector<row>& rows);
 
 // A scratch directory removed with its contents at the end of the test.
 struct scratch_dir {
@@ -93,30 +93,17 @@ struct scratch_dir {
 };
 
 // The service manager's end on Linux: a datagram socket that torvad reports
-// its states to.
-class notify_socket {
-  public:
+// its states to. As steps: "@message" expects the next report, "@*" drops
+// those still unread, "!USR2" sends torvad a SIGUSR2.
+struct notify_socket {
     notify_socket();
     ~notify_socket();
     // The next message, or "" when none comes in time.
     std::string next(int timeout_ms = 10000);
-    std::string env() const { return "NOTIFY_SOCKET=" + dir_.path + "/notify"; }
-
-  private:
-    scratch_dir dir_;
-    int fd_;
-};
-
-// "@message" expects the next state report, "@*" drops those still unread;
-// "!USR2" sends torvad a SIGUSR2.
-step_hook service_steps(notify_socket& manager);
-
-// A copy of the test child that any account can run, in a directory any
-// account can enter, wherever the build is (a checkout under /root is not).
-struct reachable_child {
-    reachable_child();
+    std::string env() const { return "NOTIFY_SOCKET=" + dir.path + "/notify"; }
+    step_hook steps();
     scratch_dir dir;
-    std::string path;
+    int fd;
 };
 
 // torvad's arguments for the test child in a mode: options, "--", the child, mode.
@@ -124,15 +111,6 @@ std::vector<std::string> child(std::vector<std::string> mode,
                                std::vector<std::string> options = {});
 bool file_exists(const std::string& path);
 std::string read_file(const std::string& path);
-void kill_process(int pid, int signal_number);
-// The peak resident memory of pid, in KiB.
-long peak_memory_kib(int pid);
-// Children of pid that are zombies (none under Wine, which has no zombies).
-int zombie_children(int pid);
-bool no_zombie_within(int pid, int timeout_ms);
-bool running_as_root();
-// A connected socket pair, as a caller of -a makes its link: ours for the peer.
-bool make_link_pair(int& ours, long& theirs);
 // A datagram socket bound at path, as a service manager or a log daemon has.
 int bound_datagram_socket(const std::string& path);
 

@@ -61,8 +61,7 @@ TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
         notify_socket manager;
         auto args = r.args;
         args.insert(args.begin(), {"-p", dir.path + "/pid", "-d", dir.path});
-        run_scenario(args, r.steps, {.terminal = false, .env = {manager.env()}},
-                     service_steps(manager));
+        run_scenario(args, r.steps, {.terminal = false, .env = {manager.env()}}, manager.steps());
         EXPECT_FALSE(file_exists(dir.path + "/pid"));
         EXPECT_EQ(manager.next(0), "");
     }
