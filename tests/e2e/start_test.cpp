@@ -15,37 +15,31 @@ namespace {
 const char* const started = "successfully started torvad version 1.1.21.0";
 }
 
-TEST(start, help_goes_to_stderr_and_nothing_else_happens) {
+// A console run with no child starts and ends at once, whatever the options;
+// outside a service manager the service path ends without a word or a child.
+TEST(start, a_run_without_child_ends_at_once_with_0) {
     scratch_dir dir;
-    std::string pid_file = dir.path + "/pid";
-    daemon_run run({"-p", pid_file, "-v", "-h", "-p"}, {.terminal = false});
-    EXPECT_EQ(run.wait_exit(), 0);
-    std::string usage = std::string("torvad version 1.1.21.0\nUsage: ") + torvad_binary +
-                        " <options> -- <exe> <exe args>\n  -h  help\n";
-    EXPECT_EQ(run.output().rfind(usage, 0), 0u) << run.output();
-    EXPECT_TRUE(run.output().ends_with("\n  -a  <pid> <pipe>\n")) << run.output();
-    EXPECT_FALSE(file_exists(pid_file));
-}
-
-// Each row runs at a console with no child: the run starts and ends at once.
-TEST(start, console_run_without_child_handles_bad_options_and_pid_files) {
-    scratch_dir dir;
-    const std::vector<std::string> rows[] = {
-        {},
-        {"-d"},
-        {"-a", "garbage", "-d", "/no/such/dir", "stray", "-zz", "-"},
-        {"-p", dir.path + "/missing/pid"},
-        {"-p", "relative.pid", "-d", dir.path},
-        {"-f", "family", "-u", "nobody", "--"},
-    };
-    for (const auto& args : rows) {
-        bool pid_error = args.size() == 2 && args[1].ends_with("/missing/pid");
-        run_scenario(args,
-                     {std::string("?") + started, "=0",
-                      pid_error ? "+failed to create pid file" : "-failed to create pid file"},
-                     {.directory = dir.path});
-        EXPECT_FALSE(file_exists(dir.path + "/relative.pid"));
-    }
+    const std::string pid = dir.path + "/pid", ok = std::string("?") + started;
+    const char* const no_pid_file = "-failed to create pid file";
+    run_rows({
+        {{}, {ok, "=0", no_pid_file}},
+        {{"-d"}, {ok, "=0", no_pid_file}},
+        {{"-a", "garbage", "-d", "/no/such/dir", "stray", "-zz", "-"}, {ok, "=0", no_pid_file}},
+        {{"-p", dir.path + "/missing/pid"}, {ok, "=0", "+failed to create pid file"}},
+        {{"-f", "family", "-u", "nobody", "--"}, {ok, "=0", no_pid_file}},
+        {{"-p", "relative.pid", "-d", dir.path}, {ok, "=0", no_pid_file}, {.directory = dir.path}},
+        // help, on stderr, and nothing else: no PID file either
+        {{"-p", pid, "-v", "-h", "-p"},
+         {"?torvad version 1.1.21.0\nUsage: " + torvad_binary + " <options> -- <exe> <exe args>\n",
+          "?  -a  <pid> <pipe>\n", "=0", "-successfully"},
+         {.terminal = false}},
+        {{"--", child_binary, "exit", "0"}, {"=0", "-torvad", "-child"}, {.terminal = false}},
+        {{"-v", "-l", "--", child_binary, "exit", "0"},
+         {"=0", "-torvad", "-child"},
+         {.terminal = false}},
+        {{"-b", "--", child_binary, "exit", "0"}, {"=0", "-torvad", "-child"}},
+    });
+    EXPECT_FALSE(file_exists(pid) || file_exists(dir.path + "/relative.pid"));
 }
 
 // A relative PID file name is taken in the starting directory, and the run
@@ -62,21 +56,6 @@ TEST(start, pid_file_holds_the_pid_while_running_and_goes_at_the_end) {
     EXPECT_EQ(run.wait_exit(), 0);
     EXPECT_FALSE(file_exists(dir.path + "/torvad.pid"));
     EXPECT_FALSE(file_exists(elsewhere.path + "/torvad.pid"));
-}
-
-// Outside a service manager the service path ends without a word or a child.
-TEST(start, service_path_outside_a_service_manager_starts_nothing) {
-    const std::pair<std::vector<std::string>, bool> rows[] = {
-        {{"--", child_binary, "exit", "0"}, false},
-        {{"-v", "-l", "--", child_binary, "exit", "0"}, false},
-        {{"-b", "--", child_binary, "exit", "0"}, true},
-    };
-    for (const auto& [args, terminal] : rows) {
-        daemon_run run(args, {.terminal = terminal});
-        EXPECT_EQ(run.wait_exit(), 0);
-        for (const char* word : {"torvad", "child"})
-            EXPECT_EQ(run.output().find(word), std::string::npos) << run.output();
-    }
 }
 
 // The event log on Linux: syslog records as a log daemon receives them from
