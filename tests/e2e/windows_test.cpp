@@ -1,8 +1,8 @@
 // The product on Windows, under Wine: the server family's start with copies of
 // the test child standing in for core.exe, powershell.exe and schtasks.exe
-// (each acts by its name and logs the arguments its command line held), the
-// event log, whose records Wine writes to its debug channel, and the service
-// path under Wine's service control manager.
+// (each acts by its name and logs its command line), the event log, whose
+// records Wine writes to its debug channel, and the service path under Wine's
+// service control manager.
 #include <gtest/gtest.h>
 
 #include <boost/process.hpp>
@@ -19,27 +19,26 @@ using namespace e2e;
 
 namespace {
 
-// The Windows program of a path the test made, as Wine shows it.
+// A path the test made, as Windows programs under Wine see it.
 std::string windows_form(std::string path) {
     std::replace(path.begin(), path.end(), '/', '\\');
     return "Z:" + path;
 }
 
 // A product directory ("my product", a blank in its path) with the test child
-// as core.exe, and a folder of tool stand-ins in front of PATH.
+// as core.exe, and the given tool stand-ins in a folder in front of PATH.
 struct installation {
-    installation() {
-        std::filesystem::create_directories(product() + "/scripts");
-        std::filesystem::create_directories(root.path + "/bin");
-        std::filesystem::copy(child_file, product() + "/core.exe");
+    explicit installation(std::vector<std::string> tools) {
+        std::filesystem::create_directories(product + "/scripts");
+        std::filesystem::create_directories(bin);
+        tools.push_back("../my product/core.exe");
+        for (const auto& tool : tools)
+            std::filesystem::copy(child_file, root.path + "/bin/" + tool);
     }
-    void tool(const std::string& name) {
-        std::filesystem::copy(child_file, root.path + "/bin/" + name);
-    }
-    std::string product() const { return root.path + "/my product"; }
-    std::string log(const std::string& name) const { return read_file(product() + "/" + name); }
-    std::string path() const { return "WINEPATH=" + windows_form(root.path + "/bin"); }
+    std::string log(const std::string& name) const { return read_file(product + "/" + name); }
     scratch_dir root;
+    std::string product = root.path + "/my product", bin = root.path + "/bin";
+    std::vector<std::string> env = {"WINEPATH=" + windows_form(root.path + "/bin")};
 };
 
 // Runs a program of Wine's to its end; its output, both streams.
@@ -56,12 +55,9 @@ std::string run_wine(const std::vector<std::string>& args, int* exit_code = null
 
 // A bounded wait for what the manager or a file shows: they tell no event.
 bool becomes_true(const std::function<bool()>& condition) {
-    for (int tries = 0; tries < 100; ++tries) {
-        if (condition())
-            return true;
+    for (int tries = 0; tries < 100 && !condition(); ++tries)
         std::this_thread::sleep_for(std::chrono::milliseconds(100));
-    }
-    return false;
+    return condition();
 }
 
 } // namespace
@@ -78,18 +74,17 @@ TEST(windows, server_family_start_runs_the_init_script_then_core) {
     };
     for (const auto& [script, checks] : rows) {
         SCOPED_TRACE(script ? script : "no script");
-        installation site;
-        site.tool("powershell.exe");
+        installation site({"powershell.exe"});
         if (script)
-            std::ofstream(site.product() + "/scripts/init.ps1", std::ios::binary) << script;
+            std::ofstream(site.product + "/scripts/init.ps1", std::ios::binary) << script;
         // Ctrl-C reaches core too: it must be ready to ignore it.
         std::vector<std::string> steps = {"?child: ready", "!INT", "?child: sigterm",
                                           "?'core' exited with 0x0.", "=0"};
         steps.insert(steps.end(), checks.begin(), checks.end());
-        run_scenario({"-d", site.product()}, steps, {.env = {site.path()}});
+        run_scenario({"-d", site.product}, steps, {.env = site.env});
         EXPECT_EQ(site.log("powershell.log"),
                   "-noprofile -noninteractive -executionpolicy bypass -file \"" +
-                      windows_form(site.product()) + "\\.\\scripts\\init.ps1\" .\n");
+                      windows_form(site.product) + "\\.\\scripts\\init.ps1\" .\n");
     }
 }
 
@@ -99,22 +94,19 @@ TEST(windows, server_family_start_runs_the_init_script_then_core) {
 TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
     if (!under_wine)
         GTEST_SKIP() << "the Windows build under Wine";
-    installation site;
-    site.tool("schtasks.exe");
-    site.tool("powershell.exe");
-    std::ofstream(site.product() + "/silent");
+    installation site({"schtasks.exe", "powershell.exe"});
+    std::ofstream(site.product + "/silent");
     std::string pid_file = site.root.path + "/pid";
-    run_scenario({"-f", "acme", "-p", pid_file, "-d", site.product()},
-                 {"=1", "-successfully started"}, {.terminal = false, .env = {site.path()}});
+    run_scenario({"-f", "acme", "-p", pid_file, "-d", site.product},
+                 {"=1", "-successfully started"}, {.terminal = false, .env = site.env});
     EXPECT_TRUE(file_exists(pid_file));
     EXPECT_EQ(site.log("powershell.log"), "");
-    std::string core = windows_form(site.product()) + "\\core.exe";
     EXPECT_EQ(site.log("schtasks.log"),
               R"(/create /f /tn startts /sc onstart /ru system /tr "powershell -command )"
               R"(""start-sleep -s 10; sc.exe config acmeServer binpath= \\"")" +
-                  core +
-                  R"(\\""; sc.exe start torvaSentryServer; schtasks.exe /delete /f /tn startts""")"
-                  "\n/run /tn startts\n");
+                  windows_form(site.product) +
+                  R"(\core.exe\\""; sc.exe start torvaSentryServer; schtasks.exe /delete /f )"
+                  "/tn startts\"\"\"\n/run /tn startts\n");
 }
 
 // Wine's event log is a stub that writes the calls and each record's strings
@@ -123,19 +115,18 @@ TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
 TEST(windows, event_log_gets_one_record_per_line_with_source_and_type) {
     if (!under_wine)
         GTEST_SKIP() << "the Windows build under Wine";
-    const std::string debug = "WINEDEBUG=fixme+advapi,+eventlog";
-    const char* const record = ",0x0000,0x00000000,0000000000000000,0x0002,0x00000000,";
+    const std::vector<std::string> debug = {"WINEDEBUG=fixme+advapi,+eventlog"};
+    const std::string record = ",0x0000,0x00000000,0000000000000000,0x0002,0x00000000,";
     run_scenario(
         {"-l", "-p", "/no/such/dir/pid"},
         {"?failed to create pid file", "?successfully started", "=0",
-         "+RegisterEventSourceA ((null),\"torvad\")", std::string("+,0x0001") + record,
+         "+RegisterEventSourceA ((null),\"torvad\")", "+,0x0001" + record,
          "+err:eventlog:ReportEventW L\"torvad\"\n",
-         "+err:eventlog:ReportEventW L\"failed to create pid file\"\n",
-         std::string("+,0x0004") + record,
+         "+err:eventlog:ReportEventW L\"failed to create pid file\"\n", "+,0x0004" + record,
          "+trace:eventlog:ReportEventW L\"successfully started torvad version 1.1.21.0\"\n"},
-        {.env = {debug}});
+        {.env = debug});
     run_scenario({"-p", "/no/such/dir/pid"}, {"?successfully started", "=0", "-EventSource"},
-                 {.env = {debug}});
+                 {.env = debug});
 }
 
 // Created, started, queried and stopped with sc.exe, as an installation runs
@@ -149,37 +140,34 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
         SCOPED_TRACE(product ? "core.exe" : "explicit command");
         scratch_dir dir;
         std::string name = "torvad_test_" + std::to_string(getpid());
-        std::string record = dir.path + (product ? "/core.log" : "/child.log");
-        std::string pid_file = dir.path + "/pid";
+        std::string record = dir.path + (product ? "/core.log" : "/child.log"),
+                    pid = dir.path + "/pid";
         // A service starts elsewhere than on drive Z:.
-        std::string command = "\"" + torvad_binary + "\" -p " + windows_form(pid_file) + " -d " +
-                              windows_form(dir.path);
-        if (product) {
-            std::filesystem::copy(child_file, dir.path + "/core.exe");
-            std::ofstream{record};
-        } else {
+        std::string command =
+            "\"" + torvad_binary + "\" -p " + windows_form(pid) + " -d " + windows_form(dir.path);
+        if (product)
+            std::filesystem::copy(child_file, dir.path + "/core.exe"), std::ofstream{record};
+        else
             command += " -- \"" + child_binary + "\" record " + windows_form(record);
-        }
         // Wine's sc tells a success by its exit code alone.
         int created = 1;
         std::string said = run_wine({"sc", "create", name, "binpath=", command}, &created);
         ASSERT_EQ(created, 0) << said;
-        run_wine({"sc", "start", name});
         auto state_is = [&name](const char* state) {
             return [&name, state] {
                 return run_wine({"sc", "query", name}).find(state) != std::string::npos;
             };
         };
+        run_wine({"sc", "start", name});
         EXPECT_TRUE(becomes_true(state_is("RUNNING")));
         EXPECT_TRUE(becomes_true([&] { return read_file(record).starts_with("version 1.1.21.0"); }))
             << read_file(record);
-        EXPECT_TRUE(file_exists(pid_file));
-
+        EXPECT_TRUE(file_exists(pid));
         run_wine({"sc", "stop", name});
         EXPECT_TRUE(becomes_true(state_is("STOPPED")));
         EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("sigterm\n"); }))
             << read_file(record);
-        EXPECT_TRUE(becomes_true([&] { return !file_exists(pid_file); }));
+        EXPECT_TRUE(becomes_true([&] { return !file_exists(pid); }));
         run_wine({"sc", "delete", name});
     }
 }
