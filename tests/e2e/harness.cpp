@@ -14,9 +14,7 @@
 #include <fstream>
 #include <poll.h>
 #include <pty.h>
-#include <sched.h>
 #include <sys/ioctl.h>
-#include <sys/mount.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -35,13 +33,8 @@ namespace {
 
 const char* const windows_build = std::getenv("TORVAD_WINDOWS_BUILD");
 
-// Windows programs see the Linux root as drive Z:.
-std::string built(const char* here, std::string windows_name) {
-    if (!windows_build)
-        return here;
-    windows_name = "Z:" + std::string(windows_build) + "/" + windows_name;
-    std::replace(windows_name.begin(), windows_name.end(), '/', '\\');
-    return windows_name;
+std::string built(const char* here, const std::string& windows_name) {
+    return windows_build ? windows_form(windows_build + ("/" + windows_name)) : here;
 }
 
 using clock = std::chrono::steady_clock;
@@ -77,13 +70,6 @@ void open_output(bool terminal, int& ours, int& theirs) {
 [[noreturn]] void exec_daemon(const std::vector<std::string>& args, const options& how, int out) {
     setsid();
     unsetenv("NOTIFY_SOCKET");
-    std::string null_node = how.dev + "/null";
-    if (!how.dev.empty() &&
-        (unshare(CLONE_NEWNS) == -1 ||
-         mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == -1 ||
-         mount("/dev/null", null_node.c_str(), nullptr, MS_BIND, nullptr) == -1 ||
-         mount(how.dev.c_str(), "/dev", nullptr, MS_BIND | MS_REC, nullptr) == -1))
-        _exit(125);
     bool console = under_wine && how.terminal;
     dup2(console ? out : open("/dev/null", O_RDONLY), 0);
     if (console)
@@ -209,6 +195,12 @@ void daemon_run::interrupt_group() {
         (void)!write(out_fd_, "\x03", 1);
     else
         kill(-pid_, SIGINT);
+}
+
+// Windows programs see the Linux root as drive Z:.
+std::string windows_form(std::string path) {
+    std::replace(path.begin(), path.end(), '/', '\\');
+    return "Z:" + path;
 }
 
 bool daemon_run::wait_for(const std::string& text, int timeout_ms) {

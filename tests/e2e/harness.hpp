@@ -30,8 +30,6 @@ struct options {
     // The start state a careless parent may leave.
     int fd_limit = 0;
     bool close_stdin = false, ignore_sigchld = false;
-    // A folder that the run sees as its /dev (needs root); it should hold "null".
-    std::string dev;
 };
 
 class daemon_run {
@@ -109,6 +107,8 @@ struct notify_socket {
 // torvad's arguments for the test child in a mode: options, "--", the child, mode.
 std::vector<std::string> child(std::vector<std::string> mode,
                                std::vector<std::string> options = {});
+// A path here as Windows programs under Wine see it.
+std::string windows_form(std::string path);
 bool file_exists(const std::string& path);
 std::string read_file(const std::string& path);
 // A datagram socket bound at path, as a service manager or a log daemon has.

@@ -1,31 +1,61 @@
-// The product as the service manager and an installation see it: the service
-// path's state reports on a real NOTIFY_SOCKET, and the start of the server
-// family or web service with stub programs on PATH that record their arguments.
+// The product as the service manager and an installation see it on Linux: the
+// service path's state reports on a real NOTIFY_SOCKET, and the start of the
+// server family or web service with stub programs on PATH that record their
+// arguments.
 #include <gtest/gtest.h>
 
-#include <csignal>
 #include <filesystem>
 #include <fstream>
-#include <poll.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include "tests/e2e/harness.hpp"
 
 using namespace e2e;
 
+namespace {
+
+// A product directory ("my product", a blank in its path) and a bin directory
+// that is all of torvad's PATH; stubs record their arguments under log/.
+struct installation {
+    installation() {
+        for (const char* sub : {"/my product/scripts", "/bin", "/log"})
+            std::filesystem::create_directories(root.path + sub);
+    }
+    // A shell script; `body` runs with the stub's arguments appended to log/name.
+    void stub(const std::string& path, const std::string& body) {
+        std::string name = std::filesystem::path(path).filename();
+        std::ofstream(root.path + path)
+            << "#!/bin/sh\nPATH=/usr/bin:/bin\nprintf '%s\\n' \"$@\" --- >> '" << root.path
+            << "/log/" << name << "'\n"
+            << body << "\n";
+        std::filesystem::permissions(root.path + path, std::filesystem::perms(0755));
+    }
+    std::string log(const std::string& name) { return read_file(root.path + "/log/" + name); }
+    scratch_dir root;
+    std::string product = root.path + "/my product";
+    std::vector<std::string> env = {"PATH=" + root.path + "/bin"};
+};
+
+const char* const answers_version = "[ \"$1\" = -h ] && { echo 'core version 7' >&2; exit 0; }\n"
+                                    "echo core runs as $(id -un)";
+const char* const core_ran = "?core runs as";
+
+class product : public ::testing::Test {
+    void SetUp() override {
+        if (!holds_here(systems::linux_only))
+            GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
+    }
+};
+
+} // namespace
+
 // The status text follows the state, naming the persistent children.
-TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
-    if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
+TEST_F(product, service_path_reports_its_states_and_ends_children_in_order) {
     const char* const running_0 = "@READY=1\nSTATUS=running, 0 children";
     const char* const running_1 = "@READY=1\nSTATUS=running, 1 child";
     const char* const stopping_0 = "@STOPPING=1\nSTATUS=stopping, waiting for 0 children";
     const char* const stopping_1 = "@STOPPING=1\nSTATUS=stopping, waiting for 1 child";
-    struct row {
-        std::vector<std::string> args, steps;
-    };
-    const row rows[] = {
+    const std::pair<std::vector<std::string>, std::vector<std::string>> rows[] = {
         // a stray SIGUSR2 changes nothing; a SIGTERM after the end can't kill
         // us; the manager's socket is ours, not the child's
         {child({"fds"}),
@@ -55,59 +85,19 @@ TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
          {"@STATUS=starting", "?failed to start torvad", running_0, stopping_0, "@STATUS=stopped",
           "=0"}},
     };
-    for (const auto& r : rows) {
-        SCOPED_TRACE(::testing::PrintToString(r.args));
+    for (auto [args, steps] : rows) {
+        SCOPED_TRACE(::testing::PrintToString(args));
         scratch_dir dir;
         notify_socket manager;
-        auto args = r.args;
         args.insert(args.begin(), {"-p", dir.path + "/pid", "-d", dir.path});
-        run_scenario(args, r.steps, {.terminal = false, .env = {manager.env()}}, manager.steps());
+        run_scenario(args, steps, {.terminal = false, .env = {manager.env()}}, manager.steps());
         EXPECT_FALSE(file_exists(dir.path + "/pid"));
         EXPECT_EQ(manager.next(0), "");
     }
 }
 
-namespace {
-
-// A product directory ("my product", a blank in its path) and a bin directory
-// that is all of torvad's PATH; stubs record their arguments under log/.
-struct installation {
-    installation() {
-        for (const char* sub : {"/my product/scripts", "/bin", "/log"})
-            std::filesystem::create_directories(root.path + sub);
-        // Service accounts must reach the programs here.
-        std::filesystem::permissions(root.path, std::filesystem::perms(0755));
-        std::filesystem::permissions(root.path + "/my product", std::filesystem::perms(0755));
-    }
-    // A shell script; `body` runs with the stub's arguments appended to log/name.
-    void stub(const std::string& path, const std::string& body) {
-        std::string name = std::filesystem::path(path).filename();
-        std::ofstream(root.path + path)
-            << "#!/bin/sh\nPATH=/usr/bin:/bin\n"
-            << "printf '%s\\n' \"$@\" --- >> '" << root.path << "/log/" << name << "'\n"
-            << body << "\n";
-        std::filesystem::permissions(root.path + path, std::filesystem::perms(0755));
-    }
-    std::string log(const std::string& name) { return read_file(root.path + "/log/" + name); }
-    std::string product() const { return root.path + "/my product"; }
-    scratch_dir root;
-};
-
-const char* const answers_version = "[ \"$1\" = -h ] && { echo 'core version 7' >&2; exit 0; }\n"
-                                    "echo core runs as $(id -un)";
-const char* const core_ran = "?core runs as";
-
-} // namespace
-
-TEST(product, server_family_start_takes_core_account_from_init_script) {
-    if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
-    struct row {
-        const char* init_script; // the body of the powershell stub; null: none on PATH
-        std::vector<std::string> steps;
-        bool unopenable_patterns = false; // present (a socket file) but can't be read
-    };
-    const row rows[] = {
+TEST_F(product, server_family_start_takes_core_account_from_init_script) {
+    const std::pair<const char*, std::vector<std::string>> rows[] = {
         {"printf 'no_such\\ruser\\r\\nnobody\\n'",
          {"?Failed to logon as user 'no_suchuser': error 2", "=0", "-deelevate"}},
         {"echo root; exit 3",
@@ -115,101 +105,89 @@ TEST(product, server_family_start_takes_core_account_from_init_script) {
         {nullptr, {"?failed to execute server init script, will not deelevate.", core_ran, "=0"}},
         // nothing printed: the service manager's socket is kept from the script
         {"echo $NOTIFY_SOCKET", {core_ran, "=0", "-deelevate", "-failed to open patterns"}},
-        {"printf '\\r\\r\\n'", {core_ran, "=0", "-Failed to logon"}, true},
+        // exec.patterns there (a socket file) but unreadable
+        {"printf '\\r\\r\\n'",
+         {core_ran, "=0", "-Failed to logon", "+failed to open patterns file 'exec.patterns'"}},
         // a megabyte on one line, then more: cut, never blocking
         {"head -c 1048576 /dev/zero | tr '\\0' x; echo; seq 100000",
          {"?Failed to logon as user 'xxxxxxxx", "=0"}},
     };
-    for (const auto& r : rows) {
-        SCOPED_TRACE(r.init_script ? r.init_script : "no powershell");
+    for (const auto& [script, steps] : rows) {
+        SCOPED_TRACE(script ? script : "no powershell");
         installation site;
         site.stub("/my product/core", answers_version);
-        if (r.init_script)
-            site.stub("/bin/powershell", r.init_script);
-        auto steps = r.steps;
-        if (r.unopenable_patterns) {
-            close(bound_datagram_socket(site.product() + "/exec.patterns"));
-            steps.push_back("+failed to open patterns file 'exec.patterns'");
-        }
-        run_scenario({"-d", site.product()}, steps,
-                     {.env = {"PATH=" + site.root.path + "/bin", "NOTIFY_SOCKET=/run/x"}});
-        if (r.init_script) {
-            EXPECT_EQ(site.log("powershell"), "-noprofile\n-noninteractive\n-executionpolicy\n"
-                                              "bypass\n-file\n" +
-                                                  site.product() + "/./scripts/init.ps1\n.\n---\n");
-        }
+        if (script)
+            site.stub("/bin/powershell", script);
+        if (steps.back().starts_with("+failed to open patterns"))
+            close(bound_datagram_socket(site.product + "/exec.patterns"));
+        site.env.push_back("NOTIFY_SOCKET=/run/x");
+        run_scenario({"-d", site.product}, steps, {.env = site.env});
+        EXPECT_EQ(site.log("powershell"),
+                  script ? "-noprofile\n-noninteractive\n-executionpolicy\nbypass\n-file\n" +
+                               site.product + "/./scripts/init.ps1\n.\n---\n"
+                         : "");
     }
 }
 
 // core stays silent on "version" (here: usage text, then megabytes): the
 // service is handed over to it and torvad ends with 1, its PID file left.
-TEST(product, silent_core_hands_the_service_over_and_ends_with_1) {
-    if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
-    const char* const silent_core = "echo 'usage: core' >&2; head -c 3000000 /dev/zero >&2";
-    for (bool task_scheduler : {true, false}) {
-        SCOPED_TRACE(task_scheduler ? "schtasks" : "systemd-run");
+TEST_F(product, silent_core_hands_the_service_over_and_ends_with_1) {
+    for (const char* scheduler : {"schtasks", "systemd-run"}) {
+        SCOPED_TRACE(scheduler);
         installation site;
-        site.stub("/my product/core", silent_core);
-        site.stub(task_scheduler ? "/bin/schtasks" : "/bin/systemd-run", "");
+        site.stub("/my product/core", "echo 'usage: core' >&2; head -c 3000000 /dev/zero >&2");
+        site.stub("/bin/" + std::string(scheduler), "");
         site.stub("/bin/powershell", "");
-        std::string pid_file = site.root.path + "/pid";
-        run_scenario({"-f", "acme", "-p", pid_file, "-d", site.product()},
-                     {"=1", "-successfully started"}, {.env = {"PATH=" + site.root.path + "/bin"}});
+        std::string pid_file = site.root.path + "/pid", core = site.product + "/core";
+        run_scenario({"-f", "acme", "-p", pid_file, "-d", site.product},
+                     {"=1", "-successfully started"}, {.env = site.env});
         EXPECT_TRUE(file_exists(pid_file));
         EXPECT_EQ(site.log("powershell"), "");
-        std::string core = site.product() + "/core";
-        if (task_scheduler) {
-            EXPECT_EQ(site.log("schtasks"),
-                      "/create\n/f\n/tn\nstartts\n/sc\nonstart\n/ru\nsystem\n/tr\n"
-                      R"(powershell -command "start-sleep -s 10; sc.exe config acmeServer )"
-                      R"(binpath= \\")" +
-                          core +
-                          R"(\\"; sc.exe start torvaSentryServer; schtasks.exe /delete /f /tn )"
-                          "startts\"\n---\n/run\n/tn\nstartts\n---\n");
+        std::string job = site.log(scheduler);
+        if (scheduler == std::string("schtasks")) {
+            EXPECT_EQ(job, "/create\n/f\n/tn\nstartts\n/sc\nonstart\n/ru\nsystem\n/tr\n"
+                           R"(powershell -command "start-sleep -s 10; sc.exe config acmeServer )"
+                           R"(binpath= \\")" +
+                               core +
+                               R"(\\"; sc.exe start torvaSentryServer; schtasks.exe /delete /f )"
+                               "/tn startts\"\n---\n/run\n/tn\nstartts\n---\n");
             continue;
         }
-        std::string job = site.log("systemd-run");
-        for (std::string part :
-             {"--on-active=10\n", "--uid=root\n", "/bin/sh\n-c\n", "Type=exec\n",
-              "--description=hand the service over to core\n",
-              "mkdir -p '/run/systemd/system/acmeServer.service.d'\n", "ExecStart=\n",
-              "systemctl daemon-reload\n", "systemctl start torvaSentryServer\n"})
+        for (const std::string& part : std::vector<std::string>{
+                 "--on-active=10\n", "--uid=root\n", "/bin/sh\n-c\n", "Type=exec\n",
+                 "--description=hand the service over to core\n",
+                 "mkdir -p '/run/systemd/system/acmeServer.service.d'\n", "ExecStart=\n",
+                 "ExecStart=\"" + core + "\"\n", "systemctl daemon-reload\n",
+                 "systemctl start torvaSentryServer\n"})
             EXPECT_NE(job.find(part), std::string::npos) << part << "\n" << job;
-        EXPECT_NE(job.find("ExecStart=\"" + core + "\"\n"), std::string::npos) << job;
     }
 }
 
 // What runs where: core wins over wfe; wfe alone runs as the local service
 // account; core runs under the account the init script names, as its own
 // report from inside shows.
-TEST(product, the_working_directory_decides_what_is_supervised) {
-    if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
-    struct row {
-        std::vector<std::string> programs, steps;
-        bool needs_root = false;
-    };
-    const row rows[] = {
+TEST_F(product, the_working_directory_decides_what_is_supervised) {
+    const std::pair<std::vector<std::string>, std::vector<std::string>> rows[] = {
         {{"core", "wfe"}, {core_ran, "=0", "-wfe runs"}},
-        {{"wfe"}, {"?wfe runs as nobody", "?'wfe' exited with 0x0.", "=0"}, true},
-        {{"wfe"}, {"?Failed to logon as user 'NT Authority\\LocalService'", "=0"}},
-        {{"test_child"}, {"?child: uid=65534 gid=65534", "!INT", "?child: sigterm", "=0"}, true},
+        {{"wfe"},
+         geteuid() == 0
+             ? std::vector<std::string>{"?wfe runs as nobody", "?'wfe' exited with 0x0.", "=0"}
+             : std::vector<std::string>{"?Failed to logon as user 'NT Authority\\LocalService'",
+                                        "=0"}},
+        {{"test_child"}, {"?child: uid=65534 gid=65534", "!INT", "?child: sigterm", "=0"}},
     };
-    for (const auto& r : rows) {
-        if (r.needs_root != (geteuid() == 0))
+    for (const auto& [programs, steps] : rows) {
+        if (programs[0] == "test_child" && geteuid() != 0)
             continue;
-        SCOPED_TRACE(r.programs.back());
+        SCOPED_TRACE(programs.back());
         installation site;
-        bool as_nobody = r.programs[0] == "test_child";
-        site.stub("/bin/powershell", as_nobody ? "printf 'nobody\\r\\n'" : "");
-        for (const auto& program : r.programs) {
+        site.stub("/bin/powershell", programs[0] == "test_child" ? "printf 'nobody\\r\\n'" : "");
+        for (const auto& program : programs)
             if (program == "test_child")
-                std::filesystem::copy(child_binary, site.product() + "/core");
+                std::filesystem::copy(child_file, site.product + "/core");
             else
                 site.stub("/my product/" + program,
                           program == "core" ? answers_version : "echo wfe runs as $(id -un)");
-        }
-        run_scenario({"-d", site.product()}, r.steps, {.env = {"PATH=" + site.root.path + "/bin"}});
+        run_scenario({"-d", site.product}, steps, {.env = site.env});
     }
 }

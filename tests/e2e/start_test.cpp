@@ -1,11 +1,8 @@
 // The program's start and end as an operator sees them: help, PID file,
-// working directory, console and service paths, event log records.
+// working directory, console and service paths.
 #include <gtest/gtest.h>
 
 #include <csignal>
-#include <fstream>
-#include <sys/socket.h>
-#include <unistd.h>
 
 #include "tests/e2e/harness.hpp"
 
@@ -56,31 +53,4 @@ TEST(start, pid_file_holds_the_pid_while_running_and_goes_at_the_end) {
     EXPECT_EQ(run.wait_exit(), 0);
     EXPECT_FALSE(file_exists(dir.path + "/torvad.pid"));
     EXPECT_FALSE(file_exists(elsewhere.path + "/torvad.pid"));
-}
-
-// The event log on Linux: syslog records as a log daemon receives them from
-// a run that sees a /dev of its own.
-TEST(start, event_log_gets_one_record_per_line_with_ident_and_priority) {
-    if (geteuid() != 0 || !holds_here(systems::linux_only))
-        GTEST_SKIP() << "needs root for a private mount namespace";
-    auto records = [](const std::vector<std::string>& args) {
-        scratch_dir dev;
-        std::ofstream(dev.path + "/null");
-        int log = bound_datagram_socket(dev.path + "/log");
-        daemon_run(args, {.dev = dev.path}).wait_exit();
-        std::string all;
-        char record[8192];
-        for (ssize_t got; (got = recv(log, record, sizeof record, MSG_DONTWAIT)) > 0;)
-            all.append(record, got) += '\n';
-        close(log);
-        return all;
-    };
-    std::string logged = records({"-l", "-p", "/no/such/dir/pid"});
-    // <27> is daemon.err, <30> daemon.info; the record is the text alone.
-    for (std::string part :
-         std::vector<std::string>{"<27>", "torvad[", "]: failed to create pid file\n", "<30>",
-                                  std::string("]: ") + started + "\n"})
-        EXPECT_NE(logged.find(part), std::string::npos) << part << "\n" << logged;
-    EXPECT_EQ(logged.find("\x1b"), std::string::npos) << logged;
-    EXPECT_EQ(records({"-p", "/no/such/dir/pid"}), "");
 }

@@ -7,7 +7,6 @@
 
 #include <boost/process.hpp>
 
-#include <algorithm>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
@@ -18,12 +17,6 @@
 using namespace e2e;
 
 namespace {
-
-// A path the test made, as Windows programs under Wine see it.
-std::string windows_form(std::string path) {
-    std::replace(path.begin(), path.end(), '/', '\\');
-    return "Z:" + path;
-}
 
 // A product directory ("my product", a blank in its path) with the test child
 // as core.exe, and the given tool stand-ins in a folder in front of PATH.

@@ -51,6 +51,13 @@ printf '[Manager]\nDefaultTimeoutStartSec=4s\n' | put /etc/systemd/system.conf.d
 
 put /var/tmp/torvad.deb "$deb"
 check "the package installs" inside dpkg -i /var/tmp/torvad.deb
+# -l: each line is also a record of the system's log, of its level's priority,
+# with torvad's name and pid, its text alone; without -l, none.
+logged() { inside journalctl --no-pager -o verbose SYSLOG_IDENTIFIER=torvad SYSLOG_FACILITY=3 \
+    PRIORITY="$1" MESSAGE="$2" | grep -c SYSLOG_PID=; }
+for flag in -l -v; do inside script -qec "torvad $flag -p /no/such/dir/pid" /dev/null >/dev/null; done
+check "-l: an error record" within 10 test "$(logged 3 "failed to create pid file")" = 1
+check "-l: an information record" test "$(logged 6 "successfully started torvad version 1.1.21.0")" = 1
 put /opt/torvad/core "$demo_core" && put /usr/local/bin/powershell "$demo/bin/powershell"
 tar -cf - -C "$demo" exec.patterns scripts | inside tar -xf - --no-same-owner -C /opt/torvad
 check "enable --now" inside systemctl enable --now torvad
