@@ -4,61 +4,25 @@
 // in CR LF.
 #pragma once
 
+#include <regex>
 #include <string>
 
 namespace e2e {
 
-// The length of the escape sequence at text[at], 0 when it isn't complete yet.
-inline std::size_t sequence_length(const std::string& text, std::size_t at) {
-    if (at + 1 >= text.size())
-        return 0;
-    if (text[at + 1] != '[')
-        return 1;
-    for (std::size_t end = at + 2; end < text.size(); ++end)
-        if (text[end] >= 0x40 && text[end] <= 0x7e)
-            return end + 1 - at;
-    return 0;
-}
-
-// Appends to text what can be told of raw; gives how much of raw that took.
+// Appends to text the whole lines of raw; gives how much of raw that took.
 inline std::size_t console_text(const std::string& raw, std::string& text) {
-    std::size_t at = 0;
-    while (at < raw.size()) {
-        if (raw[at] == '\r') {
-            if (at + 1 == raw.size())
-                break; // a line feed may follow
-            if (raw[at + 1] != '\n')
-                text += '\r';
-            ++at;
-            continue;
-        }
-        if (raw[at] != '\x1b') {
-            text += raw[at++];
-            continue;
-        }
-        std::size_t length = sequence_length(raw, at);
-        if (length == 0)
-            break;
-        std::string sequence = raw.substr(at, length);
-        if (sequence == "\x1b[K") {
-            std::size_t next = at + length;
-            std::size_t move =
-                next < raw.size() && raw[next] == '\x1b' ? sequence_length(raw, next) : 0;
-            if (next == raw.size() || (raw[next] == '\x1b' && move == 0))
-                break; // what the erase stands for comes next
-            if (move > 0 && raw[next + move - 1] == 'C') {
-                std::string count = raw.substr(next + 2, move - 3);
-                text.append(count.empty() ? 1 : std::stoul(count), ' ');
-                length += move;
-            } else if (raw[next] == '\r') {
-                text += ' ';
-            }
-        } else if (sequence != "\x1b[?25l" && sequence != "\x1b[?25h") {
-            text += sequence;
-        }
-        at += length;
+    static const std::regex drawing("\x1b\\[\\?25[lh]|\x1b\\[K(?:\x1b\\[(\\d*)C|(?=\r))|\r(?=\n)");
+    std::size_t end = raw.rfind('\n') + 1; // 0 when no line is whole yet
+    auto from = raw.cbegin();
+    for (std::sregex_iterator at(from, from + end, drawing), none; at != none; ++at) {
+        const std::smatch& match = *at;
+        text.append(match.prefix().first, match.prefix().second);
+        if (match.str().starts_with("\x1b[K"))
+            text.append(match[1].matched && match[1].length() > 0 ? std::stoul(match[1]) : 1, ' ');
+        from = match.suffix().first;
     }
-    return at;
+    text.append(from, raw.cbegin() + end);
+    return end;
 }
 
 } // namespace e2e
