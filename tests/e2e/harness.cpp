@@ -78,10 +78,9 @@ void open_output(bool terminal, int& ours, int& theirs) {
         close(0);
     if (how.ignore_sigchld)
         signal(SIGCHLD, SIG_IGN);
-    if (how.fd_limit != 0) {
-        rlimit limit{rlim_t(how.fd_limit), rlim_t(how.fd_limit)};
+    rlimit limit{rlim_t(how.fd_limit), rlim_t(how.fd_limit)};
+    if (how.fd_limit != 0)
         setrlimit(RLIMIT_NOFILE, &limit);
-    }
     for (const auto& variable : how.env)
         putenv(const_cast<char*>(variable.c_str()));
     dup2(out, 1);
@@ -94,7 +93,7 @@ void open_output(bool terminal, int& ours, int& theirs) {
         _exit(126);
     std::vector<std::string> command = {torvad_binary};
     if (under_wine)
-        command = {"wine", std::string(windows_build) + "/torvad.exe"};
+        command.insert(command.begin(), "wine");
     command.insert(command.end(), args.begin(), args.end());
     std::vector<char*> argv;
     for (auto& arg : command)
@@ -133,10 +132,8 @@ daemon_run::daemon_run(const std::vector<std::string>& args, const options& how)
 }
 
 daemon_run::~daemon_run() {
-    if (!exited_) {
-        kill(pid_, SIGKILL);
+    if (!exited_ && kill(pid_, SIGKILL) == 0)
         waitpid(pid_, nullptr, 0);
-    }
     close(out_fd_);
 }
 
@@ -150,12 +147,10 @@ bool daemon_run::read_some(int timeout_ms) {
         eof_ = true; // a pty gives EIO once every writer has gone
         return false;
     }
-    if (!console_) {
+    if (console_)
+        drawn_.append(buffer, got), drawn_.erase(0, console_text(drawn_, output_));
+    else
         output_.append(buffer, got);
-        return true;
-    }
-    drawn_.append(buffer, got);
-    drawn_.erase(0, console_text(drawn_, output_));
     return true;
 }
 
