@@ -3,7 +3,6 @@
 //   test_child <mode> [args...] [ipc fd, appended by torvad]
 #include <algorithm>
 #include <chrono>
-#include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -30,17 +29,10 @@ using namespace torvad;
 using peer::connection;
 namespace fs = std::filesystem;
 
-void say(const char* format, ...) __attribute__((format(printf, 1, 2)));
-void say(const char* format, ...) {
-    va_list args;
-    va_start(args, format);
-    char line[4096] = "child: ";
-    int length = 7 + std::min(std::vsnprintf(line + 7, sizeof line - 8, format, args),
-                              static_cast<int>(sizeof line) - 9);
-    va_end(args);
-    line[length++] = '\n';
-    // One write for the line, so it stands whole beside the supervisor's.
-    if (write(1, line, static_cast<unsigned>(length)) != length) {
+// One write for the line, so it stands whole beside the supervisor's.
+void say(std::string line) {
+    line = "child: " + line + "\n";
+    if (write(1, line.data(), static_cast<unsigned>(line.size())) < 0) {
     }
 }
 
@@ -60,9 +52,9 @@ bool greet(connection& link) {
     peer::version_info v;
     if (!peer::read_version(link, v))
         return false;
-    say("version %s %s Background:%s", v.program_name.c_str(), v.version.c_str(),
-        v.background ? "true" : "false");
-    say("ready pid=%d", getpid());
+    say("version " + v.program_name + " " + v.version +
+        " Background:" + (v.background ? "true" : "false"));
+    say("ready pid=" + std::to_string(getpid()));
     return true;
 }
 
@@ -88,7 +80,7 @@ int serve(const context& how, bool deaf = false) {
 // What the child was started with.
 int mode_fds(const context& how) {
     for (const auto& line : child_host::start_state(how.ipc_fd))
-        say("%s", line.c_str());
+        say(line);
     if (std::getenv("NOTIFY_SOCKET") != nullptr)
         say("notify socket inherited");
     return serve(how);
@@ -125,24 +117,19 @@ int mode_execute(const context& how) {
     greet(link);
     std::string batch;
     std::uint32_t channel = 0;
-    std::vector<std::string> request;
-    for (std::size_t i = once ? 3 : 0; i <= how.args.size(); ++i) {
-        if (i < how.args.size() && how.args[i] != "+") {
-            request.push_back(how.args[i]);
-            continue;
-        }
-        if (request == std::vector<std::string>{"!rmcwd"}) {
+    for (std::size_t at = once ? 3 : 0, end; at < how.args.size(); at = end + 1) {
+        end = std::find(how.args.begin() + at, how.args.end(), "+") - how.args.begin();
+        if (how.args[at] == "!rmcwd") {
             peer::write_link(how.ipc_fd, batch.data(), batch.size());
             batch.clear();
             std::error_code error;
-            say("rmcwd %d", fs::remove(fs::current_path(), error) ? 0 : -1);
-        } else if (request.size() > 1) {
-            std::string items = join_strings({request.begin() + 1, request.end()});
-            auto block = encode_packet(++channel, packet_execute, std::stoul(request[0]),
+            say(fs::remove(fs::current_path(), error) ? "rmcwd 0" : "rmcwd -1");
+        } else if (end - at > 1) {
+            std::string items = join_strings({how.args.begin() + at + 1, how.args.begin() + end});
+            auto block = encode_packet(++channel, packet_execute, std::stoul(how.args[at]),
                                        items.data(), items.size());
             batch.append(block.begin(), block.end());
         }
-        request.clear();
     }
     peer::write_link(how.ipc_fd, batch.data(), batch.size());
     peer::packet packet;
@@ -152,94 +139,16 @@ int mode_execute(const context& how) {
         return say("left"), 3;
     for (std::uint32_t ends = 0; ends < channel && link.receive(packet);) {
         const auto& h = packet.header;
+        std::string line = std::to_string(h.channel) + " " + packet_type_name(h.type);
         if (h.type == packet_sigterm)
             return 0;
-        if (h.type == packet_stdout)
-            say("%u stdout %s", h.channel, packet.payload.c_str());
-        else if (h.type == packet_opened)
-            say("%u opened", h.channel);
+        if (h.type == packet_stdout || h.type == packet_opened)
+            say(line + (h.type == packet_stdout ? " " + packet.payload : ""));
         else if ((h.type == packet_failed || h.type == packet_closed) && ++ends)
-            say("%u %s %u", h.channel, packet_type_name(h.type), h.flags);
+            say(line + " " + std::to_string(h.flags));
     }
     return await_sigterm(link);
 }
-
-// Each argument in brackets, as the program got it; a byte that a console
-// would draw otherwise as \xHH.
-int mode_args(const context& how) {
-    std::string line;
-    char hex[5];
-    for (const auto& arg : how.args) {
-        line += '[';
-        for (unsigned char c : arg)
-            line += c >= 0x20 && c < 0x7f ? std::string(1, static_cast<char>(c))
-                                          : (std::snprintf(hex, sizeof hex, "\\x%02x", c), hex);
-        line += ']';
-    }
-    say("args %s", line.c_str());
-    return 0;
-}
-
-// A peer that floods the stdin of the channel COMMAND; a send that can't go
-// out within half a second means torvad holds back.
-int mode_flood_in(const context& how) {
-    connection link(how.ipc_fd);
-    greet(link);
-    link.execute(1, execute_stdio_pipes, how.args);
-    link.limit_send_wait(500);
-    const std::size_t all = std::size_t(256) << 20;
-    std::size_t sent = 0;
-    for (std::string chunk(packet_max_payload, 'i'); sent < all && link.send_stdin(1, chunk);)
-        sent += chunk.size();
-    say("flood-in %s after %d MiB", sent < all ? "held" : "sent all", static_cast<int>(sent >> 20));
-    return await_sigterm(link);
-}
-
-const std::pair<std::string_view, int (*)(const context&)> modes[] = {
-    {"peer",
-     [](const context& how) {
-         return serve(how);
-     }},
-    {"ignore-sigterm",
-     [](const context& how) {
-         return serve(how, true);
-     }},
-    {"fds", mode_fds},
-    {"record", mode_record},
-    {"execute", mode_execute},
-    {"args", mode_args},
-    {"flood-in", mode_flood_in},
-    // "exit CODE [SECONDS]s": the unit keeps a bare number from being taken for the ipc fd.
-    {"exit",
-     [](const context& how) {
-         std::this_thread::sleep_for(std::chrono::seconds(how.number(1)));
-         return how.number(0);
-     }},
-    // Speaks as torvad on the ipc fd it was given: output of channel 9.
-    {"forge",
-     [](const context& how) {
-         return connection(how.ipc_fd).send(9, packet_stdout, 0, "forged") ? 0 : 1;
-     }},
-    // "orphans N MARKER": the first time, leaves N orphans behind, which end
-    // together with us as we exit with 3; started again, serves.
-    {"orphans",
-     [](const context& how) {
-         if (how.args.size() < 2 || !create_once(how.args[1]))
-             return serve(how);
-         return child_host::leave_orphans(how.number(0)) ? (say("orphans made"), 3) : 1;
-     }},
-    // "squat N ...": takes the name of torvad's ipc pipe number N first, then
-    // sends the requests behind N as the execute mode does.
-    {"squat",
-     [](const context& how) {
-         say("squat %s", child_host::take_pipe_name(how.number(0)) ? "taken" : "failed");
-         return mode_execute({{how.args.begin() + 1, how.args.end()}, how.ipc_fd});
-     }},
-    {"console-event",
-     [](const context& how) {
-         return child_host::console_event(how.number(0)) ? serve(how) : 1;
-     }},
-};
 
 } // namespace
 
@@ -253,22 +162,76 @@ int main(int argc, char** argv) {
     // it records to a file "core.log" that is there (a run with no console),
     // sends the requests that a file "core.execute" holds one argument a line,
     // or else reports as the fds mode does.
-    if (fs::path(argv[0]).stem() == "core") {
-        if (argc > 1 && std::string_view(argv[1]) == "-h")
-            return std::fputs(fs::exists("silent") ? "usage: core\n" : "test_child version 1\n",
-                              stderr) < 0;
-        if (fs::exists("core.log"))
-            return mode_record({{"core.log"}, how.ipc_fd});
-        std::ifstream requests("core.execute", std::ios::binary);
-        for (std::string line; std::getline(requests, line);)
-            how.args.push_back(line);
+    bool core = fs::path(argv[0]).stem() == "core";
+    if (core && argc > 1 && std::string_view(argv[1]) == "-h")
+        return std::fputs(fs::exists("silent") ? "usage: core\n" : "test_child version 1\n",
+                          stderr) < 0;
+    if (core && fs::exists("core.log"))
+        return mode_record({{"core.log"}, how.ipc_fd});
+    std::ifstream requests(core ? "core.execute" : "", std::ios::binary);
+    for (std::string line; std::getline(requests, line);)
+        how.args.push_back(line);
+    if (core)
         return how.args.empty() ? mode_fds(how) : mode_execute(how);
-    }
     if (argc > 1)
         how.args.assign(argv + 2, argv + std::max(2, argc - (how.ipc_fd >= 0)));
-    for (const auto& [name, run] : modes)
-        if (argc > 1 && name == argv[1])
-            return run(how);
+    std::string_view mode = argc > 1 ? argv[1] : "";
+    if (mode == "peer" || mode == "ignore-sigterm")
+        return serve(how, mode == "ignore-sigterm");
+    if (mode == "fds")
+        return mode_fds(how);
+    if (mode == "record")
+        return mode_record(how);
+    if (mode == "execute")
+        return mode_execute(how);
+    // Each argument in brackets, as the program got it; a byte that a console
+    // would draw otherwise as \xHH.
+    if (mode == "args") {
+        std::string line;
+        char hex[5];
+        for (const auto& arg : how.args) {
+            line += '[';
+            for (unsigned char c : arg)
+                line += c >= 0x20 && c < 0x7f ? std::string(1, static_cast<char>(c))
+                                              : (std::snprintf(hex, sizeof hex, "\\x%02x", c), hex);
+            line += ']';
+        }
+        return say("args " + line), 0;
+    }
+    // A peer that floods the stdin of the channel COMMAND; a send that can't go
+    // out within half a second means torvad holds back.
+    if (mode == "flood-in") {
+        connection link(how.ipc_fd);
+        greet(link);
+        link.execute(1, execute_stdio_pipes, how.args);
+        link.limit_send_wait(500);
+        const std::size_t all = std::size_t(256) << 20;
+        std::size_t sent = 0;
+        for (std::string chunk(packet_max_payload, 'i'); sent < all && link.send_stdin(1, chunk);)
+            sent += chunk.size();
+        say(std::string("flood-in ") + (sent < all ? "held" : "sent all") + " after " +
+            std::to_string(sent >> 20) + " MiB");
+        return await_sigterm(link);
+    }
+    // "exit CODE [SECONDS]s": the unit keeps a bare number from being taken for the ipc fd.
+    if (mode == "exit")
+        return std::this_thread::sleep_for(std::chrono::seconds(how.number(1))), how.number(0);
+    // Speaks as torvad on the ipc fd it was given: output of channel 9.
+    if (mode == "forge")
+        return connection(how.ipc_fd).send(9, packet_stdout, 0, "forged") ? 0 : 1;
+    // "orphans N MARKER": the first time, leaves N orphans behind, which end
+    // together with us as we exit with 3; started again, serves.
+    if (mode == "orphans" && (how.args.size() < 2 || !create_once(how.args[1])))
+        return serve(how);
+    if (mode == "orphans")
+        return child_host::leave_orphans(how.number(0)) ? (say("orphans made"), 3) : 1;
+    // "squat N ...": takes the name of torvad's ipc pipe number N first, then
+    // sends the requests behind N as the execute mode does.
+    if (mode == "squat")
+        return say(child_host::take_pipe_name(how.number(0)) ? "squat taken" : "squat failed"),
+               mode_execute({{how.args.begin() + 1, how.args.end()}, how.ipc_fd});
+    if (mode == "console-event")
+        return child_host::console_event(how.number(0)) ? serve(how) : 1;
     std::fprintf(stderr, "usage: test_child <mode> [args...] [ipc fd]\n");
     return 64;
 }
