@@ -71,15 +71,12 @@ struct rig final : process_owner {
     const run_facts& facts() const override { return run; }
     void write_log(platform::event_type, const char* text) override { log.emplace_back(text); }
 
-    void write_bytes(const std::string& bytes) {
+    void send(const std::string& bytes) {
         ASSERT_EQ(write(fd, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
     }
-    void send(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-              const std::string& payload) {
-        write_bytes(packet_bytes(channel, type, flags, payload));
-    }
     void execute(std::uint32_t channel, std::uint32_t flags, const std::string& shell_line) {
-        send(channel, packet_execute, flags, join_strings({"/bin/sh", "-c", shell_line}));
+        send(packet_bytes(channel, packet_execute, flags,
+                          join_strings({"/bin/sh", "-c", shell_line})));
     }
     // Runs the loop until torvad has read every byte written so far (bounded).
     void let_read() {
@@ -135,8 +132,9 @@ std::string opened_closed(const std::string& between, int status = 0) {
 // id is free again at once.
 TEST(process, a_channel_ends_after_its_output_and_frees_its_id_at_once) {
     rig peer;
-    peer.send(1, packet_execute, 0, join_strings({"/no/such/program"}));
-    peer.send(1, packet_stdin, 0, "lost"); // a failed request leaves no channel behind
+    peer.send(packet_bytes(1, packet_execute, 0, join_strings({"/no/such/program"})));
+    // a failed request leaves no channel behind
+    peer.send(packet_bytes(1, packet_stdin, 0, "lost"));
     peer.execute(2, execute_stdio_pipes, "printf out; printf err >&2; exit 3");
     ASSERT_TRUE(peer.read_until(2, packet_closed));
     EXPECT_EQ(peer.packets.at(0).first.type, packet_failed);
@@ -211,11 +209,11 @@ TEST(process, a_channel_relays_its_standard_streams_in_order) {
         sent[i] = static_cast<char>('a' + i % 26);
     peer.execute(7, execute_stdio_pipes, "cat; echo eof >&2");
     peer.execute(8, execute_stdio_none, "sleep 1");
-    peer.send(7, packet_stdin, 0, sent.substr(0, 6000));
-    peer.send(7, packet_stdin, 0, sent.substr(6000));
-    peer.send(8, packet_stdin, 0, "nobody reads this");
+    peer.send(packet_bytes(7, packet_stdin, 0, sent.substr(0, 6000)));
+    peer.send(packet_bytes(7, packet_stdin, 0, sent.substr(6000)));
+    peer.send(packet_bytes(8, packet_stdin, 0, "nobody reads this"));
     ASSERT_TRUE(peer.read_until([&] { return peer.story(7) == "<opened>" + sent; }));
-    peer.send(7, packet_stdin, stdin_close, "tail");
+    peer.send(packet_bytes(7, packet_stdin, stdin_close, "tail"));
     ASSERT_TRUE(peer.read_until(7, packet_closed));
     EXPECT_EQ(peer.story(7), opened_closed(sent + "tail" + "eof\n"));
     for (const auto& [h, payload] : peer.packets) {
@@ -246,7 +244,7 @@ TEST(process, packets_are_framed_across_reads_and_traced) {
     for (auto [pieces, lines] : rows) {
         rig peer(true);
         for (const auto& piece : pieces) {
-            peer.write_bytes(piece);
+            peer.send(piece);
             peer.let_read();
         }
         peer.requester->terminate();
