@@ -1,6 +1,5 @@
 #include <csignal>
 #include <cstdio>
-#include <cstdlib>
 #include <fcntl.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>

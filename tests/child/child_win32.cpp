@@ -2,7 +2,6 @@
 
 #include <tlhelp32.h>
 
-#include <cstdio>
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
@@ -32,8 +31,8 @@ bool leave_orphans(int) {
     return false;
 }
 
-namespace {
-DWORD parent_id() {
+// The process that started us: torvad, whose pipes and console we aim at.
+static DWORD parent_id() {
     HANDLE all = CreateToolhelp32Snapshot(TH32CS_SNAPPROCESS, 0);
     PROCESSENTRY32 entry{};
     entry.dwSize = sizeof entry;
@@ -44,7 +43,6 @@ DWORD parent_id() {
     CloseHandle(all);
     return parent;
 }
-} // namespace
 
 // Left open until we end, as a squatter would hold it.
 bool take_pipe_name(int n) {
