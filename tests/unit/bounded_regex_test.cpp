@@ -27,11 +27,7 @@ const std::string long_argument(65520 - 11, 'y');
 } // namespace
 
 TEST(bounded_regex, decides_as_the_library_does_or_gives_up_within_the_bound) {
-    struct row {
-        std::string pattern, text;
-        match_verdict expected;
-    };
-    const row rows[] = {
+    const std::tuple<std::string, std::string, match_verdict> rows[] = {
         // The whole text: items joined by NUL bytes, written \0 in a pattern.
         {R"(/bin/echo\0.*)", "/bin/echo\0hello\0world"s, yes},
         {R"(/bin/echo\0.*)", "/bin/echo", no},
@@ -65,8 +61,8 @@ TEST(bounded_regex, decides_as_the_library_does_or_gives_up_within_the_bound) {
         {R"((a|a)*\1b)", std::string(40, 'a'), undecided},
         {"(?:a|b?){5000}", std::string(65520, 'a'), undecided},
     };
-    for (const auto& r : rows)
-        EXPECT_EQ(verdict(r.pattern, r.text), r.expected) << r.pattern;
+    for (const auto& [pattern, text, expected] : rows)
+        EXPECT_EQ(verdict(pattern, text), expected) << pattern;
 }
 
 TEST(bounded_regex, refuses_what_the_library_refuses) {

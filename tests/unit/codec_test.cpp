@@ -9,11 +9,7 @@
 using namespace torvad;
 
 TEST(codec, split_strings_gives_separators_plus_one_items) {
-    struct row {
-        std::string data;
-        std::vector<std::string> items;
-    };
-    const row rows[] = {
+    const std::pair<std::string, std::vector<std::string>> rows[] = {
         {"", {""}},
         {"abc", {"abc"}},
         {std::string("a\0b", 3), {"a", "b"}},
@@ -23,9 +19,9 @@ TEST(codec, split_strings_gives_separators_plus_one_items) {
         {std::string("a\0\0b", 4), {"a", "", "b"}},
         {"\xff\x80", {"\xff\x80"}},
     };
-    for (const auto& r : rows) {
-        EXPECT_EQ(split_strings(r.data.data(), r.data.size(), '\0'), r.items);
-        EXPECT_EQ(join_strings(r.items), r.data);
+    for (const auto& [data, items] : rows) {
+        EXPECT_EQ(split_strings(data.data(), data.size(), '\0'), items);
+        EXPECT_EQ(join_strings(items), data);
     }
     // Nothing at or behind data + size is read: the NUL there would add an item.
     const char bounded[] = {'a', 'b', '\0', 'c'};
@@ -43,29 +39,27 @@ TEST(codec, quote_argument_escapes_only_its_set) {
 }
 
 TEST(codec, packets_match_their_bytes) {
-    struct row {
-        std::uint32_t channel, type, flags;
-        std::string payload, hex;
-    };
-    const row rows[] = {
-        {0x300002, packet_stdin, stdin_close, "abc", "13000000 02003000 00000000 01000000 616263"},
-        {0x300002, packet_opened, 4660, "", "10000000 02003000 03000000 34120000"},
-        {0x300002, packet_failed, 13, "", "10000000 02003000 04000000 0d000000"},
-        {0, packet_sigterm, 0, "", "10000000 00000000 08000000 00000000"},
-        {0x300002, packet_execute, execute_persistent | execute_user,
-         join_strings({"svc", "tool.exe", "-x"}),
-         "1f000000 02003000 06000000 09000000 73766300 746f6f6c2e65786500 2d78"},
-    };
-    for (const auto& r : rows) {
-        auto framed = encode_packet(r.channel, r.type, r.flags, r.payload.data(), r.payload.size());
-        std::string expected = r.hex, hex;
+    const std::tuple<std::uint32_t, std::uint32_t, std::uint32_t, std::string, std::string> rows[] =
+        {
+            {0x300002, packet_stdin, stdin_close, "abc",
+             "13000000 02003000 00000000 01000000 616263"},
+            {0x300002, packet_opened, 4660, "", "10000000 02003000 03000000 34120000"},
+            {0x300002, packet_failed, 13, "", "10000000 02003000 04000000 0d000000"},
+            {0, packet_sigterm, 0, "", "10000000 00000000 08000000 00000000"},
+            {0x300002, packet_execute, execute_persistent | execute_user,
+             join_strings({"svc", "tool.exe", "-x"}),
+             "1f000000 02003000 06000000 09000000 73766300 746f6f6c2e65786500 2d78"},
+        };
+    for (auto [channel, type, flags, payload, expected] : rows) {
+        auto framed = encode_packet(channel, type, flags, payload.data(), payload.size());
+        std::string hex;
         std::erase(expected, ' ');
         for (unsigned char byte : framed)
             hex += {"0123456789abcdef"[byte >> 4], "0123456789abcdef"[byte & 15]};
         EXPECT_EQ(hex, expected);
         packet_header header = read_packet_header(framed.data());
         EXPECT_EQ(std::tuple(header.length, header.channel, header.type, header.flags),
-                  std::tuple(std::uint32_t(framed.size()), r.channel, r.type, r.flags));
+                  std::tuple(std::uint32_t(framed.size()), channel, type, flags));
     }
     for (auto [length, valid] :
          {std::pair{15u, false}, {16u, true}, {65536u, true}, {65537u, false}})

@@ -4,28 +4,23 @@
 #include "entry/command_line.hpp"
 #include "ipc/packet.hpp"
 
-namespace {
-
-// The scanned values in one line, so that each case is one row.
-std::string scanned(std::vector<std::string> args) {
-    args.insert(args.begin(), "torvad");
-    std::vector<char*> argv;
-    for (auto& arg : args)
-        argv.push_back(arg.data());
-    auto c = torvad::scan_command_line(static_cast<int>(argv.size()), argv.data());
-    std::string text = std::string(c.help ? "h" : "") + (c.verbose ? "v" : "") +
-                       (c.logging ? "l" : "") + (c.background ? "b" : "") +
-                       (c.no_restart ? "o" : "") + " f=" + c.family + " u=" + c.user +
-                       " d=" + c.directory + " p=" + (c.pid_file ? c.pid_file : "null") +
-                       " a=" + std::to_string(c.attach_pid) + "," + std::to_string(c.attach_pipe);
-    for (const auto& word : c.command)
-        text += " [" + word + "]";
-    return text;
-}
-
-} // namespace
-
 TEST(command_line, options_values_and_the_end_of_the_scan) {
+    // The scanned values in one line, so that each case is one row.
+    auto scanned = [](std::vector<std::string> args) {
+        args.insert(args.begin(), "torvad");
+        std::vector<char*> argv;
+        for (auto& arg : args)
+            argv.push_back(arg.data());
+        auto c = torvad::scan_command_line(static_cast<int>(argv.size()), argv.data());
+        std::string text =
+            std::string(c.help ? "h" : "") + (c.verbose ? "v" : "") + (c.logging ? "l" : "") +
+            (c.background ? "b" : "") + (c.no_restart ? "o" : "") + " f=" + c.family +
+            " u=" + c.user + " d=" + c.directory + " p=" + (c.pid_file ? c.pid_file : "null") +
+            " a=" + std::to_string(c.attach_pid) + "," + std::to_string(c.attach_pipe);
+        for (const auto& word : c.command)
+            text += " [" + word + "]";
+        return text;
+    };
     const std::string plain = " f=torvaSentry u= d= p=null a=0,-1";
     const std::pair<std::vector<std::string>, std::string> rows[] = {
         {{}, plain},
@@ -48,16 +43,17 @@ TEST(command_line, options_values_and_the_end_of_the_scan) {
 
 TEST(command_line, help_names_the_program_and_every_option) {
     EXPECT_EQ(torvad::help_text("prog"), std::string("torvad version ") + torvad::torvad_version +
-                                             "\n"
-                                             "Usage: prog <options> -- <exe> <exe args>\n"
-                                             "  -h  help\n"
-                                             "  -v  verbose\n"
-                                             "  -l  enable logging\n"
-                                             "  -b  start service\n"
-                                             "  -o  disable auto restart after failure\n"
-                                             "  -f  <product family>\n"
-                                             "  -u  <user>\n"
-                                             "  -d  <directory>\n"
-                                             "  -p  <pid file>\n"
-                                             "  -a  <pid> <pipe>\n");
+                                             R"(
+Usage: prog <options> -- <exe> <exe args>
+  -h  help
+  -v  verbose
+  -l  enable logging
+  -b  start service
+  -o  disable auto restart after failure
+  -f  <product family>
+  -u  <user>
+  -d  <directory>
+  -p  <pid file>
+  -a  <pid> <pipe>
+)");
 }

@@ -1,9 +1,7 @@
 // The console line: both forms, the cut at 4095 characters, and -v.
 #include <gtest/gtest.h>
 
-#include <cstdio>
 #include <regex>
-#include <unistd.h>
 
 #include "daemon/daemon.hpp"
 
@@ -22,20 +20,10 @@ TEST(log, line_forms_by_level_colour_and_length) {
     };
     supervisor the_daemon({});
     for (const auto& [coloured, log, pattern] : rows) {
-        // The line goes to a file standing in for stdout.
         the_daemon.set_colour(coloured);
-        std::fflush(stdout);
-        std::FILE* sink = std::tmpfile();
-        int saved = dup(1);
-        dup2(fileno(sink), 1);
+        testing::internal::CaptureStdout();
         log(the_daemon);
-        std::fflush(stdout);
-        dup2(saved, 1);
-        close(saved);
-        std::string line(8192, '\0');
-        std::rewind(sink);
-        line.resize(std::fread(line.data(), 1, line.size(), sink));
-        std::fclose(sink);
+        std::string line = testing::internal::GetCapturedStdout();
         EXPECT_TRUE(std::regex_match(line, std::regex(pattern))) << line;
     }
 }

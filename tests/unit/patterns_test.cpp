@@ -78,14 +78,10 @@ TEST(patterns, execute_requests_take_user_and_path_items_first) {
     execute_decision refused = decide(execute_user | execute_path, {"nobody", "/usr/bin/id"});
     EXPECT_STREQ(refused.refusal, "path not specified");
     EXPECT_EQ(refused.status, status_malformed);
-    execute_request accepted =
-        decide(execute_user | execute_path | execute_stdio_none, {"nobody", "", "/usr/bin/id"})
-            .request;
-    EXPECT_EQ(accepted.user, "nobody");
-    EXPECT_EQ(accepted.working_directory, ""); // an empty path is ours
-    EXPECT_EQ(accepted.command, std::vector<std::string>{"/usr/bin/id"});
-    EXPECT_EQ(accepted.stdio_mode, stdio_none);
-    EXPECT_FALSE(accepted.persistent);
+    auto r = decide(execute_user | execute_path | execute_stdio_none, {"nobody", "", "/usr/bin/id"})
+                 .request; // an empty path is ours
+    EXPECT_EQ(std::tie(r.user, r.working_directory, r.command, r.stdio_mode, r.persistent),
+              std::tuple("nobody", "", std::vector<std::string>{"/usr/bin/id"}, stdio_none, false));
 }
 
 // What torvad-patterns check finds: each kind of line torvad skips, and the

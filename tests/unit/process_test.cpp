@@ -2,8 +2,6 @@
 // asks for channels, and the test reads what comes back in the loop's turns.
 #include <gtest/gtest.h>
 
-#include <algorithm>
-#include <chrono>
 #include <fstream>
 #include <functional>
 #include <linux/sockios.h>
@@ -17,14 +15,50 @@
 namespace torvad {
 namespace {
 
-struct fake_owner final : process_owner {
+// length, when given, replaces the true length field: a lie for the framer.
+std::string packet_bytes(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                         const std::string& payload, std::uint32_t length = 0) {
+    auto bytes = encode_packet(channel, type, flags, payload.data(), payload.size());
+    if (length != 0)
+        store_u32(reinterpret_cast<unsigned char*>(bytes.data()), length);
+    return {bytes.begin(), bytes.end()};
+}
+
+// The owner, and the peer's end of the pipe that a requester process serves.
+struct rig final : process_owner {
     boost::asio::io_context context;
     run_facts run;
     pattern_lists everything;
     std::vector<std::shared_ptr<process>> children;
     std::vector<std::uint32_t> ended; // each end's status, as the owner is told it
-    bool restart_killed = false;      // makes a successor for a child killed by a signal
+    std::vector<std::string> log;
+    bool restart_killed = false; // makes a successor for a child killed by a signal
+    std::shared_ptr<process> requester;
+    std::vector<std::pair<packet_header, std::string>> packets; // all that came but the version
+    std::string unframed;
+    int fd;
 
+    // send_buffer, when given, bounds what torvad's end of the socket holds.
+    explicit rig(bool verbose = false, int send_buffer = 0) {
+        run.verbose = verbose;
+        int ends[2];
+        EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);
+        if (send_buffer != 0)
+            setsockopt(ends[1], SOL_SOCKET, SO_SNDBUF, &send_buffer, sizeof send_buffer);
+        fd = ends[0];
+        requester = process::create(*this, {{"peer"}, "", ".", true, stdio_inherit});
+        requester->attach(1, ends[1]);
+        log.clear();
+    }
+    // As the daemon's shutdown: nothing outlives the loop.
+    ~rig() {
+        for (const auto& child : children)
+            child->close_all();
+        context.restart();
+        context.run();
+        children.clear();
+        close(fd);
+    }
     boost::asio::io_context& loop() override { return context; }
     void adopt(std::shared_ptr<process> child) override { children.push_back(std::move(child)); }
     void remove(const std::shared_ptr<process>& child) override { std::erase(children, child); }
@@ -35,120 +69,59 @@ struct fake_owner final : process_owner {
     }
     const pattern_lists& patterns() const override { return everything; }
     const run_facts& facts() const override { return run; }
-    std::vector<std::string> log;
     void write_log(platform::event_type, const char* text) override { log.emplace_back(text); }
 
-    // As the daemon's shutdown: nothing outlives the loop.
-    ~fake_owner() {
-        for (const auto& child : children)
-            child->close_all();
-        context.restart();
-        context.run();
-        children.clear();
+    void send(const std::string& bytes) {
+        ASSERT_EQ(write(fd, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
     }
-};
-
-// length, when given, replaces the true length field: a lie for the framer.
-std::string packet_bytes(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                         const std::string& payload, std::uint32_t length = 0) {
-    auto bytes = encode_packet(channel, type, flags, payload.data(), payload.size());
-    if (length != 0)
-        store_u32(reinterpret_cast<unsigned char*>(bytes.data()), length);
-    return {bytes.begin(), bytes.end()};
-}
-
-struct packet {
-    std::uint32_t channel, type, flags;
-    std::string payload;
-};
-
-// The peer's end: a requester process serves the other one.
-class peer_pipe {
-  public:
-    // send_buffer, when given, bounds what torvad's end of the socket holds.
-    explicit peer_pipe(fake_owner& owner, int send_buffer = 0) {
-        int ends[2];
-        EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);
-        if (send_buffer != 0)
-            setsockopt(ends[1], SOL_SOCKET, SO_SNDBUF, &send_buffer, sizeof send_buffer);
-        fd_ = ends[0];
-        requester = process::create(owner, {{"peer"}, "", ".", true, stdio_inherit});
-        requester->attach(1, ends[1]);
-        owner_ = &owner;
-    }
-    ~peer_pipe() { close(fd_); }
-
-    void write_bytes(const std::string& bytes) {
-        ASSERT_EQ(write(fd_, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+    void execute(std::uint32_t channel, std::uint32_t flags, const std::string& shell_line) {
+        send(packet_bytes(channel, packet_execute, flags,
+                          join_strings({"/bin/sh", "-c", shell_line})));
     }
     // Runs the loop until torvad has read every byte written so far (bounded).
     void let_read() {
-        int unread = 1;
-        for (int turns = 0; turns < 2000 && ioctl(fd_, SIOCOUTQ, &unread) == 0 && unread > 0;
+        for (int turns = 0, unread = 1; turns < 2000 && ioctl(fd, SIOCOUTQ, &unread) == 0 && unread;
              ++turns)
-            owner_->context.run_for(std::chrono::milliseconds(1));
+            context.run_for(std::chrono::milliseconds(1));
     }
-    void send(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-              const std::string& payload) {
-        write_bytes(packet_bytes(channel, type, flags, payload));
-    }
-    void execute(std::uint32_t channel, std::uint32_t flags, const std::string& shell_line) {
-        send(channel, packet_execute, flags, join_strings({"/bin/sh", "-c", shell_line}));
-    }
-    // Runs the loop until count packets of type on channel have come
-    // (bounded), keeping every packet but the version.
+    // Runs the loop until count packets of type have come on channel, or
+    // until done() (bounded).
     bool read_until(std::uint32_t channel, std::uint32_t type, long count = 1) {
         return read_until([&] {
-            return std::count_if(packets.begin(), packets.end(), [&](const packet& p) {
-                       return p.channel == channel && p.type == type;
+            return std::count_if(packets.begin(), packets.end(), [&](const auto& p) {
+                       return p.first.channel == channel && p.first.type == type;
                    }) >= count;
         });
     }
     bool read_until(const std::function<bool()>& done) {
         auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-        while (std::chrono::steady_clock::now() < deadline) {
-            owner_->context.run_for(std::chrono::milliseconds(5));
+        while (!done() && std::chrono::steady_clock::now() < deadline) {
+            context.run_for(std::chrono::milliseconds(5));
             char chunk[65536];
-            ssize_t got;
-            while ((got = read(fd_, chunk, sizeof chunk)) > 0)
-                buffer_.append(chunk, static_cast<std::size_t>(got));
-            while (buffer_.size() >= packet_header_size) {
-                packet_header header = read_packet_header(buffer_.data());
-                if (buffer_.size() < header.length)
-                    break;
-                std::string payload(buffer_, packet_header_size,
-                                    header.length - packet_header_size);
-                buffer_.erase(0, header.length);
-                if (header.type != packet_version)
-                    packets.push_back({header.channel, header.type, header.flags, payload});
-            }
-            if (done())
-                return true;
+            for (ssize_t got; (got = read(fd, chunk, sizeof chunk)) > 0;)
+                unframed.append(chunk, static_cast<std::size_t>(got));
+            for (packet_header h;
+                 unframed.size() >= packet_header_size &&
+                 unframed.size() >= (h = read_packet_header(unframed.data())).length;
+                 unframed.erase(0, h.length))
+                if (h.type != packet_version)
+                    packets.emplace_back(
+                        h, unframed.substr(packet_header_size, h.length - packet_header_size));
         }
-        return false;
+        return done();
     }
     // What came on channel: its output as text, the rest by type name, an
     // end with its status.
     std::string story(std::uint32_t channel) const {
         std::string text;
-        for (const auto& p : packets)
-            if (p.channel != channel)
-                continue;
-            else if (p.type <= packet_stderr)
-                text += p.payload;
-            else
-                text += std::string("<") + packet_type_name(p.type) +
-                        (p.type == packet_opened ? "" : ":" + std::to_string(p.flags)) + ">";
+        for (const auto& [h, payload] : packets)
+            if (h.channel == channel)
+                text += h.type <= packet_stderr   ? payload
+                        : h.type == packet_opened ? "<opened>"
+                                                  : std::string("<") + packet_type_name(h.type) +
+                                                        ":" + std::to_string(h.flags) + ">";
         return text;
     }
-
-    std::shared_ptr<process> requester;
-    std::vector<packet> packets;
-
-  private:
-    fake_owner* owner_;
-    int fd_;
-    std::string buffer_;
 };
 
 std::string opened_closed(const std::string& between, int status = 0) {
@@ -158,20 +131,20 @@ std::string opened_closed(const std::string& between, int status = 0) {
 // Pipelined requests end in the order asked, output ahead of the end, and an
 // id is free again at once.
 TEST(process, a_channel_ends_after_its_output_and_frees_its_id_at_once) {
-    fake_owner owner;
-    peer_pipe peer(owner);
-    peer.send(1, packet_execute, 0, join_strings({"/no/such/program"}));
-    peer.send(1, packet_stdin, 0, "lost"); // a failed request leaves no channel behind
+    rig peer;
+    peer.send(packet_bytes(1, packet_execute, 0, join_strings({"/no/such/program"})));
+    // a failed request leaves no channel behind
+    peer.send(packet_bytes(1, packet_stdin, 0, "lost"));
     peer.execute(2, execute_stdio_pipes, "printf out; printf err >&2; exit 3");
     ASSERT_TRUE(peer.read_until(2, packet_closed));
-    ASSERT_GE(peer.packets.size(), 2u);
-    EXPECT_EQ(peer.packets[0].type, packet_failed);
-    EXPECT_EQ(peer.packets[1].type, packet_opened);
+    EXPECT_EQ(peer.packets.at(0).first.type, packet_failed);
+    EXPECT_EQ(peer.packets.at(1).first.type, packet_opened);
     EXPECT_EQ(peer.story(2), opened_closed("outerr", 3));
     peer.execute(1, execute_stdio_pipes, "printf again");
     ASSERT_TRUE(peer.read_until(1, packet_closed));
     EXPECT_EQ(peer.story(1), "<failed:2>" + opened_closed("again"));
-    EXPECT_EQ(std::count(owner.log.begin(), owner.log.end(), "channel 0x1 does not exist"), 1);
+    EXPECT_EQ(peer.log, (std::vector<std::string>{"failed to create child process.",
+                                                  "channel 0x1 does not exist"}));
 }
 
 // A requester that doesn't read holds its channel's output back: the child
@@ -180,12 +153,11 @@ TEST(process, a_channel_ends_after_its_output_and_frees_its_id_at_once) {
 // the peer reads again every byte arrives, in order, before closed.
 TEST(process, output_waits_for_a_requester_that_does_not_read) {
     for (auto [size, ends_unread] : {std::pair{std::size_t(1) << 20, false}, {300u << 10, true}}) {
-        fake_owner owner;
-        peer_pipe peer(owner, 4096);
+        rig peer(false, 4096);
         peer.execute(1, execute_stdio_pipes,
                      "head -c " + std::to_string(size) + " /dev/zero | tr '\\0' x");
-        owner.context.run_for(std::chrono::milliseconds(500));
-        EXPECT_EQ(owner.ended.size(), ends_unread ? 1u : 0u) << size;
+        peer.context.run_for(std::chrono::milliseconds(500));
+        EXPECT_EQ(peer.ended.size(), ends_unread ? 1u : 0u) << size;
         ASSERT_TRUE(peer.read_until(1, packet_closed));
         EXPECT_TRUE(peer.story(1) == opened_closed(std::string(size, 'x'))) << size;
     }
@@ -194,17 +166,16 @@ TEST(process, output_waits_for_a_requester_that_does_not_read) {
 // What the owner hears of each end (the exit status, 128 + a signal), and a
 // successor it makes takes its predecessor's place on the requester's pipe.
 TEST(process, the_owner_hears_each_end_and_restarts_in_place) {
-    fake_owner owner;
-    owner.restart_killed = true;
-    peer_pipe peer(owner);
+    rig peer;
+    peer.restart_killed = true;
     std::string marker = testing::TempDir() + "/killed-once";
     unlink(marker.c_str());
     peer.execute(1, 0, "exit 5");
     peer.execute(2, 0, "test -e " + marker + " && exit 0; touch " + marker + "; kill -9 $$");
     ASSERT_TRUE(peer.read_until(2, packet_closed, 2));
     ASSERT_TRUE(peer.read_until(1, packet_closed));
-    std::sort(owner.ended.begin(), owner.ended.end());
-    EXPECT_EQ(owner.ended, (std::vector<std::uint32_t>{0, 5, 137}));
+    std::sort(peer.ended.begin(), peer.ended.end());
+    EXPECT_EQ(peer.ended, (std::vector<std::uint32_t>{0, 5, 137}));
     // The successor opens before its predecessor's closed goes out.
     EXPECT_EQ(peer.story(2), "<opened><opened><closed:137><closed:0>");
     unlink(marker.c_str());
@@ -213,51 +184,43 @@ TEST(process, the_owner_hears_each_end_and_restarts_in_place) {
 // A child the terminal stopped (it read the terminal from its background
 // group) can't take its sigterm: a stop continues it, and names the stop.
 TEST(process, a_stop_continues_a_child_the_terminal_stopped) {
-    fake_owner owner;
-    peer_pipe peer(owner);
+    rig peer;
     peer.execute(1, execute_persistent, "kill -TTIN $$; exit 7");
     ASSERT_TRUE(peer.read_until(1, packet_opened));
-    std::string stat = "/proc/" + std::to_string(peer.packets.back().flags) + "/stat";
-    auto stopped = [&] {
-        std::ifstream file(stat);
+    std::string stat = "/proc/" + std::to_string(peer.packets.back().first.flags) + "/stat";
+    ASSERT_TRUE(peer.read_until([&] {
         std::string pid, name, state;
-        return file >> pid >> name >> state && state == "T";
-    };
-    for (int tries = 0; tries < 2000 && !stopped(); ++tries)
-        owner.context.run_for(std::chrono::milliseconds(5));
-    ASSERT_TRUE(stopped());
-    auto child = owner.children.back();
-    child->terminate();
-    EXPECT_NE(child->description().find("stopped by the terminal"), std::string::npos);
+        return std::ifstream(stat) >> pid >> name >> state && state == "T";
+    }));
+    peer.children.back()->terminate();
+    EXPECT_NE(peer.children.back()->description().find("stopped by the terminal"),
+              std::string::npos);
     ASSERT_TRUE(peer.read_until(1, packet_closed));
-    EXPECT_EQ(owner.ended, std::vector<std::uint32_t>{7});
+    EXPECT_EQ(peer.ended, std::vector<std::uint32_t>{7});
 }
 
 // A channel's standard streams travel over its requester's pipe, in order and
 // in packets of one relayed read at most; stdin only reaches a channel with
 // pipes, and its close flag holds even when the queue had drained.
 TEST(process, a_channel_relays_its_standard_streams_in_order) {
-    fake_owner owner;
-    peer_pipe peer(owner);
+    rig peer;
     std::string sent(10000, 'a');
     for (std::size_t i = 0; i < sent.size(); ++i)
         sent[i] = static_cast<char>('a' + i % 26);
     peer.execute(7, execute_stdio_pipes, "cat; echo eof >&2");
     peer.execute(8, execute_stdio_none, "sleep 1");
-    peer.send(7, packet_stdin, 0, sent.substr(0, 6000));
-    peer.send(7, packet_stdin, 0, sent.substr(6000));
-    peer.send(8, packet_stdin, 0, "nobody reads this");
+    peer.send(packet_bytes(7, packet_stdin, 0, sent.substr(0, 6000)));
+    peer.send(packet_bytes(7, packet_stdin, 0, sent.substr(6000)));
+    peer.send(packet_bytes(8, packet_stdin, 0, "nobody reads this"));
     ASSERT_TRUE(peer.read_until([&] { return peer.story(7) == "<opened>" + sent; }));
-    peer.send(7, packet_stdin, stdin_close, "tail");
+    peer.send(packet_bytes(7, packet_stdin, stdin_close, "tail"));
     ASSERT_TRUE(peer.read_until(7, packet_closed));
     EXPECT_EQ(peer.story(7), opened_closed(sent + "tail" + "eof\n"));
-    std::string err;
-    for (const auto& p : peer.packets) {
-        EXPECT_LE(p.payload.size(), 4096u);
-        err += p.type == packet_stderr ? p.payload : "";
+    for (const auto& [h, payload] : peer.packets) {
+        EXPECT_LE(payload.size(), 4096u);
+        EXPECT_EQ(h.type == packet_stderr, payload == "eof\n");
     }
-    EXPECT_EQ(err, "eof\n");
-    EXPECT_EQ(owner.log, std::vector<std::string>{"channel 0x8 standard input is not available"});
+    EXPECT_EQ(peer.log, std::vector<std::string>{"channel 0x8 standard input is not available"});
 }
 
 // Bytes of packets split across reads and joined in one are framed in order;
@@ -278,19 +241,15 @@ TEST(process, packets_are_framed_across_reads_and_traced) {
         {{packet_bytes(0x500003, 9, 4, "zz") + packet_bytes(1, packet_sigterm, 0, "")},
          {"<- peer:psfile:3 unknown ", "<- peer:1 sigterm "}},
     };
-    for (const auto& [pieces, lines] : rows) {
-        fake_owner owner;
-        owner.run.verbose = true;
-        peer_pipe peer(owner);
-        owner.log.clear();
+    for (auto [pieces, lines] : rows) {
+        rig peer(true);
         for (const auto& piece : pieces) {
-            peer.write_bytes(piece);
+            peer.send(piece);
             peer.let_read();
         }
         peer.requester->terminate();
-        auto expected = lines;
-        expected.push_back("-> peer:0 sigterm ");
-        EXPECT_EQ(owner.log, expected);
+        lines.push_back("-> peer:0 sigterm ");
+        EXPECT_EQ(peer.log, lines);
     }
 }
 

@@ -19,12 +19,7 @@ TEST(trace, channel_labels_name_known_modules) {
 }
 
 TEST(trace, details_by_packet_type) {
-    struct row {
-        std::uint32_t type, flags;
-        std::string payload;
-        std::string name, details;
-    };
-    const row rows[] = {
+    const std::tuple<std::uint32_t, std::uint32_t, std::string, std::string, std::string> rows[] = {
         {packet_stdin, 0, "ab\n\x07", "stdin", "ab\\n\\x7"},
         {packet_stdin, 1, "ab\n\x07", "stdin", "ab\\n\\x7 flags=0x1"},
         {packet_stdout, 0, "\t\r\xff", "stdout", "\\x9\\r\\xff"},
@@ -41,11 +36,11 @@ TEST(trace, details_by_packet_type) {
         {packet_version, 0, version_payload("torvad", torvad_version, false), "version",
          "\"torvad\" \"1.1.21.0\" \"Background:false\" "},
     };
-    for (const auto& r : rows) {
-        auto packet = encode_packet(1, r.type, r.flags, r.payload.data(), r.payload.size());
+    for (const auto& [type, flags, payload, name, details] : rows) {
+        auto packet = encode_packet(1, type, flags, payload.data(), payload.size());
         trace_text text =
             describe_packet(read_packet_header(packet.data()), packet.data() + packet_header_size);
-        EXPECT_STREQ(text.type_name, r.name.c_str());
-        EXPECT_EQ(text.details, r.details);
+        EXPECT_EQ(text.type_name, name);
+        EXPECT_EQ(text.details, details);
     }
 }
