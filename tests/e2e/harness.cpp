@@ -15,7 +15,6 @@
 #include <poll.h>
 #include <pty.h>
 #include <sys/ioctl.h>
-#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -74,13 +73,6 @@ void open_output(bool terminal, int& ours, int& theirs) {
     dup2(console ? out : open("/dev/null", O_RDONLY), 0);
     if (console)
         ioctl(0, TIOCSCTTY, 0);
-    if (how.close_stdin)
-        close(0);
-    if (how.ignore_sigchld)
-        signal(SIGCHLD, SIG_IGN);
-    rlimit limit{rlim_t(how.fd_limit), rlim_t(how.fd_limit)};
-    if (how.fd_limit != 0)
-        setrlimit(RLIMIT_NOFILE, &limit);
     for (const auto& variable : how.env)
         putenv(const_cast<char*>(variable.c_str()));
     dup2(out, 1);
@@ -94,6 +86,8 @@ void open_output(bool terminal, int& ours, int& theirs) {
     std::vector<std::string> command = {torvad_binary};
     if (under_wine)
         command.insert(command.begin(), "wine");
+    if (!how.shell.empty())
+        command.insert(command.begin(), {"/bin/bash", "-c", how.shell + "; exec \"$@\"", "bash"});
     command.insert(command.end(), args.begin(), args.end());
     std::vector<char*> argv;
     for (auto& arg : command)

@@ -27,9 +27,7 @@ struct options {
     long inherit = -1;            // one more fd the daemon keeps
     std::vector<std::string> env; // NAME=value set in the environment
     std::string directory;        // where it starts; empty: ours
-    // The start state a careless parent may leave.
-    int fd_limit = 0;
-    bool close_stdin = false, ignore_sigchld = false;
+    std::string shell;            // run first, as a careless parent leaves the start state
 };
 
 class daemon_run {

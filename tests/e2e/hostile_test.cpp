@@ -28,7 +28,7 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         // out of descriptors: launches fail with the errno, the daemon serves on
         {child(many_channels),
          {"?failed to create child process.", "?failed 24", "!INT", "=0"},
-         {.fd_limit = 64},
+         {.shell = "ulimit -n 64"},
          systems::linux_only},
         // a working directory deleted under us: only a relative name is not found
         {{"-d", doomed.path, "--", child_binary, "execute", "!rmcwd", "+", "0", "./prog", "+", "0",
@@ -53,12 +53,12 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         // a closed stdin at start: the child still gets fds 0, 1, 2 and its pipe
         {{"--", child_binary, "fds"},
          {"?child: fds clean", "!INT", "=0"},
-         {.close_stdin = true},
+         {.shell = "exec 0<&-"},
          systems::linux_only},
         // an inherited SIGCHLD ignore must not hide exits from us
         {{"--", child_binary, "execute", "once", dir.path + "/failed", "0"},
          {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "!INT", "=0"},
-         {.ignore_sigchld = true},
+         {.shell = "trap '' CHLD"},
          systems::linux_only},
         // Ctrl-C reaches the terminal's whole group; the child ends by sigterm, not by it
         {{"--", child_binary, "peer"},
