@@ -34,16 +34,16 @@ struct installation {
     std::vector<std::string> env = {"WINEPATH=" + windows_form(root.path + "/bin")};
 };
 
-// Runs a program of Wine's to its end; its output, both streams.
+// Runs a program of Wine's to its end; its output, both streams. Through a
+// file: a program of Wine's own session that it starts holds a pipe open.
 std::string run_wine(const std::vector<std::string>& args, int* exit_code = nullptr) {
     namespace bp = boost::process;
-    bp::ipstream out;
-    bp::child tool(bp::search_path("wine"), bp::args(args), (bp::std_out & bp::std_err) > out);
-    std::string output{std::istreambuf_iterator<char>(out), {}};
-    tool.wait();
+    scratch_dir dir;
+    int code = bp::system(bp::search_path("wine"), bp::args(args),
+                          (bp::std_out & bp::std_err) > dir.path + "/out");
     if (exit_code != nullptr)
-        *exit_code = tool.exit_code();
-    return output;
+        *exit_code = code;
+    return read_file(dir.path + "/out");
 }
 
 // A bounded wait for what the manager or a file shows: they tell no event.
