@@ -1,6 +1,7 @@
 #include <csignal>
 #include <cstdio>
 #include <fcntl.h>
+#include <fstream>
 #include <sys/prctl.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -56,7 +57,10 @@ bool leave_orphans(int count) {
             prctl(PR_SET_PDEATHSIG, SIGUSR1);
             if (getppid() == parent)
                 sigwaitinfo(&adopted, nullptr);
-            std::printf("child: orphan adopted by %d\n", getppid());
+            std::ifstream adopter("/proc/" + std::to_string(getppid()) + "/comm");
+            std::string name;
+            adopter >> name;
+            std::printf("child: orphan adopted by %s\n", name.c_str());
             std::fflush(stdout);
             for (char byte; read(fds[0], &byte, 1) > 0;) {
             }

@@ -36,23 +36,21 @@ class daemon_run {
     ~daemon_run();
     daemon_run(const daemon_run&) = delete;
 
-    // Reads until text appears behind the cursor; moves the cursor behind it.
+    // Reads until text appears behind the cursor, or anywhere (the cursor kept).
     bool wait_for(const std::string& text, int timeout_ms = event_wait_ms);
-    // Reads until text appears anywhere; the cursor stays where it was.
     bool wait_anywhere(const std::string& text);
     // The exit code, or -1 when it didn't end in time (it is killed then).
     int wait_exit(int timeout_ms = event_wait_ms);
-    // A stop request: the signal on Linux, Ctrl-C typed at the console under Wine.
+    // A stop request: the signal, or under Wine Ctrl-C typed at the console;
+    // Ctrl-C to its terminal's whole group.
     void signal(int signal_number);
-    // Ctrl-C as a terminal gives it: to torvad and whatever shares its terminal.
     void interrupt_group();
     int pid() const { return pid_; }
     const char* at_cursor() const { return output_.c_str() + cursor_; }
     const std::string& output() const { return output_; }
 
   private:
-    // Appends what is there within timeout_ms to output_; false when nothing came.
-    bool read_some(int timeout_ms);
+    bool read_some(int timeout_ms); // false when nothing came in time
     int pid_ = -1, out_fd_ = -1, exit_code_ = -1;
     bool console_, eof_ = false, exited_ = false;
     std::string output_, drawn_; // drawn_: console bytes not yet told as text
@@ -81,7 +79,7 @@ struct row {
 };
 void run_rows(const std::vector<row>& rows);
 
-// A scratch directory removed with its contents at the end of the test.
+// A directory removed with its contents at the end of the test.
 struct scratch_dir {
     scratch_dir();
     ~scratch_dir();
@@ -94,8 +92,7 @@ struct scratch_dir {
 struct notify_socket {
     notify_socket();
     ~notify_socket();
-    // The next message, or "" when none comes in time.
-    std::string next(int timeout_ms = 10000);
+    std::string next(int timeout_ms = 10000); // "" when none comes in time
     std::string env() const { return "NOTIFY_SOCKET=" + dir.path + "/notify"; }
     step_hook steps();
     scratch_dir dir;
