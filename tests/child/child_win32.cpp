@@ -73,6 +73,31 @@ bool console_event(int n) {
 // schtasks and powershell append what follows the program on their command
 // line, as the line holds it, to <tool>.log in the working directory;
 // powershell then prints the script behind -file, and fails when there is none.
+bool start_attached(const std::string& torvad, int& ours, long& theirs) {
+    std::string name = "\\\\.\\pipe\\torvad_caller_" + std::to_string(GetCurrentProcessId());
+    HANDLE server =
+        CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
+                         PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE, 1, 8192, 8192, 0, nullptr);
+    HANDLE client = CreateFileA(name.c_str(), GENERIC_READ | GENERIC_WRITE, 0, nullptr,
+                                OPEN_EXISTING, FILE_FLAG_OVERLAPPED, nullptr);
+    theirs = static_cast<long>(reinterpret_cast<std::intptr_t>(server));
+    std::string command = "\"" + torvad + "\" -v -a " + std::to_string(GetCurrentProcessId()) +
+                          " " + std::to_string(theirs) + " -- never_run";
+    STARTUPINFOA start{};
+    start.cb = sizeof start;
+    PROCESS_INFORMATION started{};
+    if (client == INVALID_HANDLE_VALUE ||
+        !SetHandleInformation(server, HANDLE_FLAG_INHERIT, HANDLE_FLAG_INHERIT) ||
+        !CreateProcessA(nullptr, command.data(), nullptr, nullptr, TRUE, 0, nullptr, nullptr,
+                        &start, &started))
+        return false;
+    CloseHandle(started.hThread);
+    CloseHandle(started.hProcess);
+    CloseHandle(server); // torvad holds its own copy
+    ours = static_cast<int>(reinterpret_cast<std::intptr_t>(client));
+    return true;
+}
+
 int stand_in_for_tool(const char* self) {
     std::string tool = std::filesystem::path(self).stem().string(), line = GetCommandLineA();
     if (tool != "schtasks" && tool != "powershell")

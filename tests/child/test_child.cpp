@@ -230,6 +230,21 @@ int main(int argc, char** argv) {
     if (mode == "squat")
         return say(child_host::take_pipe_name(how.number(0)) ? "squat taken" : "squat failed"),
                mode_execute({{how.args.begin() + 1, how.args.end()}, how.ipc_fd});
+    // "attach TORVAD CHILD": makes a pipe and starts TORVAD on its far end, as
+    // a caller of -a does; as the peer, has it run CHILD forging on that end,
+    // with pipes, so that the launch passes handles on at all.
+    int ours = -1;
+    long theirs = -1;
+    if (mode == "attach" && child_host::start_attached(how.args.at(0), ours, theirs)) {
+        connection link(ours);
+        peer::packet packet;
+        bool forged = !link.receive(packet) || packet.header.type != packet_version ||
+                      !link.execute(1, execute_stdio_pipes,
+                                    {how.args.at(1), "forge", std::to_string(theirs)});
+        while (!forged && link.receive(packet) && packet.header.type != packet_closed)
+            forged = packet.header.channel == 9;
+        return say(forged ? "attach forged" : "attach clean"), 0;
+    }
     if (mode == "console-event")
         return child_host::console_event(how.number(0)) ? serve(how) : 1;
     std::fprintf(stderr, "usage: test_child <mode> [args...] [ipc fd]\n");

@@ -85,6 +85,11 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {"?refused to run '", "?child: 1 failed 193", "?child: 2 failed 193", "!INT", "=0"},
          {},
          systems::windows_only},
+        // a program run at an attached peer's request can't write on the peer's pipe
+        {child({"attach", torvad_binary, child_binary}),
+         {"?child: attach clean", "?attached ipc pipe closed.", "=0", "-attach forged"},
+         {},
+         systems::windows_only},
         // a pipe name taken before torvad makes it fails the launch; nothing reaches the taker
         {{"-v", "--", child_binary, "squat", "1", "1", child_binary, "peer"},
          {"?child: squat taken", "?failed to create ipc pipe.", "?failed to create ipc pipe.",
