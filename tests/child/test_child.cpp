@@ -160,7 +160,6 @@ int main(int argc, char** argv) {
     // Named core (core.exe), it stands in for the product's server program: it
     // answers -h with its version on stderr (a file "silent" keeps that back);
     // it records to a file "core.log" that is there (a run with no console),
-    // sends the requests that a file "core.execute" holds one argument a line,
     // or else reports as the fds mode does.
     bool core = fs::path(argv[0]).stem() == "core";
     if (core && argc > 1 && std::string_view(argv[1]) == "-h")
@@ -168,11 +167,8 @@ int main(int argc, char** argv) {
                           stderr) < 0;
     if (core && fs::exists("core.log"))
         return mode_record({{"core.log"}, how.ipc_fd});
-    std::ifstream requests(core ? "core.execute" : "", std::ios::binary);
-    for (std::string line; std::getline(requests, line);)
-        how.args.push_back(line);
     if (core)
-        return how.args.empty() ? mode_fds(how) : mode_execute(how);
+        return mode_fds(how);
     if (argc > 1)
         how.args.assign(argv + 2, argv + std::max(2, argc - (how.ipc_fd >= 0)));
     std::string_view mode = argc > 1 ? argv[1] : "";

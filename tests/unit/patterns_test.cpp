@@ -109,3 +109,45 @@ TEST(patterns, check_names_skipped_lines_and_warns) {
     file.open_failure = "failed to open patterns file 'p'";
     EXPECT_EQ(patterns_tool::check("p", file).status, 2);
 }
+
+// What torvad-patterns explain says of a request, and its exit status: the
+// line that permitted, or the refusal with every line tried.
+TEST(patterns, explain_names_the_deciding_line_or_every_line_tried) {
+    const std::string demo = "# own\nuname\\0-[a-z]+\n(all) id\\0-un\n";
+    const std::string longest(65520 - 11, 'y'); // a whole packet behind "/bin/echo\0x"
+    const std::tuple<std::string, std::vector<std::string>, std::string, int> rows[] = {
+        {demo, {"--", "uname", "-a"}, "permitted by line 2: uname\\0-[a-z]+\n", 0},
+        {demo,
+         {"-r", "svc", "--", "uname", "-a", "-r"},
+         "text: uname\\0-a\\0-r\nrefused: permission to execute denied\n"
+         "    line 2 (no match): uname\\0-[a-z]+\n    line 3 (no match): (all) id\\0-un\n",
+         13},
+        {demo,
+         {"-u", "nobody", "--", "uname", "-a"},
+         "refused: permission to change user denied\n    line 3 (no match): (all) id\\0-un\n",
+         13},
+        {demo, {"-u", "nobody", "--", "id", "-un"}, "permitted by line 3: (all) id\\0-un", 0},
+        {"(\n/bin/true\n", {"--", "("}, "denied\n    line 2 (no match): /bin/true\n", 13},
+        {"([^\\0]*)\\0\\1\n", {"--", "/bin/echo", "/bin/echo"}, "permitted by line 1", 0},
+        {"/bin/echo\\0x.*\n", {"--", "/bin/echo", "x" + longest}, "permitted by line 1", 0},
+        {"/bin/echo\\0x(y|y)*\\1z\n",
+         {"--", "/bin/echo", "x" + longest},
+         "refused: undecided within the bounds\n    line 1 (undecided)",
+         13},
+        {demo, {"-u", "--", "id"}, "", -1},
+        {demo, {"--"}, "", -1},
+    };
+    for (const auto& [patterns, request, explained, status] : rows) {
+        std::vector<std::string> args = {"explain", "p"};
+        args.insert(args.end(), request.begin(), request.end());
+        patterns_tool::command_line parsed;
+        ASSERT_EQ(patterns_tool::parse_command_line(args, parsed), status >= 0);
+        if (status < 0)
+            continue;
+        patterns_file file;
+        file.lists = parse_patterns(patterns, file.skipped);
+        auto report = patterns_tool::explain(parsed, file, platform::thread_cpu_nanoseconds);
+        EXPECT_NE(report.out.find(explained), std::string::npos) << report.out;
+        EXPECT_EQ(report.status, status) << report.out;
+    }
+}

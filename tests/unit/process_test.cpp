@@ -9,7 +9,9 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include "ipc/patterns.hpp"
 #include "ipc/strings.hpp"
+#include "matcher/bounded_regex.hpp"
 #include "process/process.hpp"
 
 namespace torvad {
@@ -161,6 +163,22 @@ TEST(process, output_waits_for_a_requester_that_does_not_read) {
         ASSERT_TRUE(peer.read_until(1, packet_closed));
         EXPECT_TRUE(peer.story(1) == opened_closed(std::string(size, 'x'))) << size;
     }
+}
+
+// A request of the largest size that no line decides within the bound is
+// refused, and the log says why.
+TEST(process, a_request_undecided_within_the_bound_is_refused) {
+    rig peer;
+    std::vector<skipped_line> skipped;
+    peer.everything = parse_patterns("/bin/echo\\0x(y|y)*\\1z\n", skipped);
+    std::string items = join_strings({"/bin/echo", "x" + std::string(65520 - 11, 'y')});
+    peer.send(packet_bytes(1, packet_execute, 0, items));
+    ASSERT_TRUE(peer.read_until(1, packet_failed));
+    EXPECT_EQ(peer.story(1), "<failed:13>");
+    EXPECT_EQ(peer.log,
+              (std::vector<std::string>{"a pattern could not be matched within " +
+                                            std::to_string(regex_time_bound_ms) + " ms; refused",
+                                        "permission to execute denied"}));
 }
 
 // What the owner hears of each end (the exit status, 128 + a signal), and a
