@@ -21,8 +21,8 @@ bool take_pipe_name(int n);
 // Console control event n (1 Ctrl-Break, 2 close) to our parent, as the
 // console delivers one; false where there are no such events.
 bool console_event(int n);
-// Makes a pipe and starts torvad with -a on its far end (theirs); false where
-// the end-to-end test itself is the caller (Linux).
+// Makes a pipe and starts torvad with -a on its far end (theirs), as a peer
+// that runs torvad for itself does.
 bool start_attached(const std::string& torvad, int& ours, long& theirs);
 // Named for a tool of the system that the tests run (Windows: powershell,
 // schtasks), the child stands in for it and gives its exit code; else -1.

@@ -88,9 +88,9 @@ int mode_fds(const context& how) {
 
 // A peer whose report goes to the file FILE, for a run with no console to
 // write to (a service): its version, then its sigterm.
-int mode_record(const context& how) {
-    std::ofstream report(how.args.at(0), std::ios::app | std::ios::binary);
-    connection link(how.ipc_fd);
+int record(const std::string& file, int ipc_fd) {
+    std::ofstream report(file, std::ios::app | std::ios::binary);
+    connection link(ipc_fd);
     peer::version_info version;
     if (!peer::read_version(link, version))
         return 5;
@@ -166,7 +166,7 @@ int main(int argc, char** argv) {
         return std::fputs(fs::exists("silent") ? "usage: core\n" : "test_child version 1\n",
                           stderr) < 0;
     if (core && fs::exists("core.log"))
-        return mode_record({{"core.log"}, how.ipc_fd});
+        return record("core.log", how.ipc_fd);
     if (core)
         return mode_fds(how);
     if (argc > 1)
@@ -176,8 +176,6 @@ int main(int argc, char** argv) {
         return serve(how, mode == "ignore-sigterm");
     if (mode == "fds")
         return mode_fds(how);
-    if (mode == "record")
-        return mode_record(how);
     if (mode == "execute")
         return mode_execute(how);
     // Each argument in brackets, as the program got it; a byte that a console
@@ -195,13 +193,13 @@ int main(int argc, char** argv) {
         return say("args " + line), 0;
     }
     // A peer that floods the stdin of the channel COMMAND; a send that can't go
-    // out within half a second means torvad holds back.
+    // out within half a second means torvad holds back, far short of 16 MiB.
     if (mode == "flood-in") {
         connection link(how.ipc_fd);
         greet(link);
         link.execute(1, execute_stdio_pipes, how.args);
         link.limit_send_wait(500);
-        const std::size_t all = std::size_t(256) << 20;
+        const std::size_t all = std::size_t(16) << 20;
         std::size_t sent = 0;
         for (std::string chunk(packet_max_payload, 'i'); sent < all && link.send_stdin(1, chunk);)
             sent += chunk.size();

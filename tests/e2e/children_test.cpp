@@ -1,5 +1,5 @@
 // Children from launch to exit, with the real binary: version first, restarts,
-// stops, launch failures, account switch and descriptor hygiene.
+// stops, the trace, launch failures, account switch and descriptor hygiene.
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -32,10 +32,15 @@ TEST(children, launch_exit_restart_and_stop) {
     const std::string copy = anyone.path + "/test_child"; // its rows hold on Linux alone
     std::filesystem::copy(child_file, copy);
     run_rows({
-        // version comes first; a stop is a sigterm packet, and 0 ends the run
+        // version comes first; a stop is a sigterm packet, and 0 ends the run;
+        // -v traces packets, coloured at a terminal
         {child({"peer"}),
          {"?child: version " + torvad_name + " 1.1.21.0 Background:false", "?child: ready", "!INT",
-          stopping, "?child: sigterm", "?'test_child' exited with 0x0.", "=0"}},
+          stopping, "?child: sigterm", "?'test_child' exited with 0x0.", "=0", "-version\x1b"}},
+        {child({"peer"}, {"-v"}),
+         {"?\x1b[36m-> test_child:0\x1b[35m version\x1b[0m \"" + torvad_name +
+              "\" \"1.1.21.0\" \"Background:false\" \n",
+          "!INT", "=0"}},
         {child({"exit", "0"}), {"?'test_child' exited with 0x0.", "=0", "-again"}},
         {child({"exit", "3"}, {"-o"}), {"?'test_child' exited with 0x3.", "=0", "-again"}},
         // failures restart at once

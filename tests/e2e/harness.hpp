@@ -24,7 +24,6 @@ bool holds_here(systems where);
 
 struct options {
     bool terminal = true;         // stdout and stderr on a terminal (a console), else a pipe
-    long inherit = -1;            // one more fd the daemon keeps
     std::vector<std::string> env; // NAME=value set in the environment
     std::string directory;        // where it starts; empty: ours
     std::string shell;            // run first, as a careless parent leaves the start state
@@ -64,7 +63,6 @@ class daemon_run {
 //   "+text" text appears anywhere                    "&text" waits for text anywhere
 //   "z"     within the bound, no child of torvad is a zombie
 //   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
-//   "M<n>"  torvad's peak memory stayed below n MiB
 // A test's own steps, tried before those above; true when it took the step.
 using step_hook = std::function<bool(const std::string& step, daemon_run& run)>;
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,

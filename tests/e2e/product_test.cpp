@@ -68,11 +68,6 @@ TEST_F(product, service_path_reports_its_states_and_ends_children_in_order) {
         {child({"peer"}),
          {"@STATUS=starting", "!TERM", running_1, stopping_1, "?child: sigterm", "@STATUS=stopped",
           "=0"}},
-        // a second stop request must not cut the children's end short
-        {child({"ignore-sigterm"}),
-         {"@STATUS=starting", running_1, "#ready pid", "!TERM", stopping_1,
-          "?child: sigterm ignored", "!TERM", "kill 9", "?'test_child' exited with 0x89.",
-          "@STATUS=stopped", "=0", "-again"}},
         // a persistent channel counts; the order of the two ends at the stop is open
         {child({"execute", "1", child_binary, "peer"}),
          {"@STATUS=starting", running_1, "@STATUS=running, 2 children", "!TERM",

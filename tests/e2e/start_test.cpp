@@ -24,6 +24,7 @@ TEST(start, a_run_without_child_ends_at_once_with_0) {
         {{"-a", "garbage", "-d", "/no/such/dir", "stray", "-zz", "-"}, {ok, "=0", no_pid_file}},
         {{"-p", dir.path + "/missing/pid"}, {ok, "=0", "+failed to create pid file"}},
         {{"-f", "family", "-u", "nobody", "--"}, {ok, "=0", no_pid_file}},
+        {{"-a", "4242"}, {"?failed to attach to ipc pipe.", "?executable not specified", "=0"}},
         {{"-p", "relative.pid", "-d", dir.path}, {ok, "=0", no_pid_file}, {.directory = dir.path}},
         // help, on stderr, and nothing else: no PID file either
         {{"-p", pid, "-v", "-h", "-p"},

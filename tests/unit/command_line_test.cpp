@@ -2,7 +2,6 @@
 #include <gtest/gtest.h>
 
 #include "entry/command_line.hpp"
-#include "ipc/packet.hpp"
 
 TEST(command_line, options_values_and_the_end_of_the_scan) {
     // The scanned values in one line, so that each case is one row.
@@ -39,21 +38,4 @@ TEST(command_line, options_values_and_the_end_of_the_scan) {
     };
     for (const auto& [args, expected] : rows)
         EXPECT_EQ(scanned(args), expected) << ::testing::PrintToString(args);
-}
-
-TEST(command_line, help_names_the_program_and_every_option) {
-    EXPECT_EQ(torvad::help_text("prog"), std::string("torvad version ") + torvad::torvad_version +
-                                             R"(
-Usage: prog <options> -- <exe> <exe args>
-  -h  help
-  -v  verbose
-  -l  enable logging
-  -b  start service
-  -o  disable auto restart after failure
-  -f  <product family>
-  -u  <user>
-  -d  <directory>
-  -p  <pid file>
-  -a  <pid> <pipe>
-)");
 }
