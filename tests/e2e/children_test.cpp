@@ -17,21 +17,10 @@ const char* const stopping = "?stopping torvad version 1.1.21.0...";
 TEST(children, launch_exit_restart_and_stop) {
     scratch_dir dir, anyone; // a copy of the child that nobody may run from where nobody may be
     notify_socket manager;
-    // Two orphans end the moment their supervised ancestor exits with 3: they
-    // come to us, at a console and as a service alike, and are reaped; the
-    // supervised exit is still read as 3, so the child restarts.
-    const std::vector<std::string> orphans = {"?child: orphans made",
-                                              "?'test_child' exited with 0x3.",
-                                              "?starting 'test_child' again.",
-                                              "?child: ready",
-                                              "&child: orphan adopted by torvad\n",
-                                              "z",
-                                              "!TERM",
-                                              "?child: sigterm",
-                                              "=0"};
+    const options root{.where = systems::linux_only, .as_root = true};
     const std::string copy = anyone.path + "/test_child"; // its rows hold on Linux alone
     std::filesystem::copy(child_file, copy);
-    run_rows({
+    std::vector<row> rows = {
         // version comes first; a stop is a sigterm packet, and 0 ends the run;
         // -v traces packets, coloured at a terminal
         {child({"peer"}),
@@ -47,11 +36,6 @@ TEST(children, launch_exit_restart_and_stop) {
         {child({"no_such_mode"}),
          {"?exited with 0x40.", "?starting 'test_child' again.", "?starting 'test_child' again.",
           "!TERM", stopping, "=0"}},
-        {child({"orphans", "2", dir.path + "/orphaned"}), orphans, {}, systems::linux_only},
-        {child({"orphans", "2", dir.path + "/orphaned-too"}),
-         orphans,
-         {.terminal = false, .env = {manager.env()}},
-         systems::linux_only},
         // a storm that ends clean, leaving no zombie behind
         {child({"execute", "once", dir.path + "/failed", "0"}),
          {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "z", "!TERM",
@@ -69,29 +53,35 @@ TEST(children, launch_exit_restart_and_stop) {
         // writing to a peer that closed its end must not kill us
         {{"--", "/bin/sh", "-c", "exec 3>&-; echo closed ipc pid=$$; exec sleep 30"},
          {"#closed ipc pid", "!INT", stopping, "kill 15", "?'sh' exited with 0x8f.", "=0"},
-         {},
-         systems::linux_only},
+         on_linux},
         // a child holds fds 0, 1, 2 and its ipc end only, with default signals
         {child({"fds"}, {"-v"}),
          {"?child: fds clean", "?child: sigmask empty", "?child: ignored.\n", "!INT", "=0"},
-         {},
-         systems::linux_only},
+         on_linux},
         {{"-u", "nobody", "-d", anyone.path, "--", copy, "fds"},
          {"?child: uid=65534 gid=65534 groups=65534", "!INT", "=0"},
-         {},
-         systems::linux_only,
-         true},
+         root},
         {child({"fds"}, {"-u", "no_such_user_xyz"}),
          {"?Failed to logon as user 'no_such_user_xyz': error 2", "=0", "-child: "},
-         {},
-         systems::linux_only,
-         true},
+         root},
         {child({"fds"}, {"-u", "OTHERDOMAIN\\nobody"}),
          {"?Failed to logon as user 'OTHERDOMAIN\\nobody': error 2", "=0", "-child: "},
-         {},
-         systems::linux_only,
-         true},
-    });
+         root},
+    };
+    // Two orphans end the moment their supervised ancestor exits with 3: they
+    // come to us, at a console and as a service alike, and are reaped; the
+    // supervised exit is still read as 3, so the child restarts.
+    for (const auto& [marker, how] :
+         {std::pair{"/orphaned", on_linux},
+          {"/orphaned-too",
+           options{.terminal = false, .env = {manager.env()}, .where = systems::linux_only}}})
+        rows.push_back(
+            {child({"orphans", "2", dir.path + marker}),
+             {"?child: orphans made", "?'test_child' exited with 0x3.",
+              "?starting 'test_child' again.", "?child: ready",
+              "&child: orphan adopted by torvad\n", "z", "!TERM", "?child: sigterm", "=0"},
+             how});
+    run_rows(rows);
 }
 
 // When a requester ends, its channels lose their pipes and run on: a cat

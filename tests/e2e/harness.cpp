@@ -262,7 +262,7 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
 
 void run_rows(const std::vector<row>& rows) {
     for (const auto& r : rows) {
-        if (!holds_here(r.where) || (r.needs_root && geteuid() != 0))
+        if (!holds_here(r.how.where) || (r.how.as_root && geteuid() != 0))
             continue;
         SCOPED_TRACE(::testing::PrintToString(r.args).substr(0, 200));
         run_scenario(r.args, r.steps, r.how);

@@ -23,11 +23,15 @@ enum class systems { both, linux_only, windows_only };
 bool holds_here(systems where);
 
 struct options {
-    bool terminal = true;         // stdout and stderr on a terminal (a console), else a pipe
-    std::vector<std::string> env; // NAME=value set in the environment
-    std::string directory;        // where it starts; empty: ours
-    std::string shell;            // run first, as a careless parent leaves the start state
+    bool terminal = true;          // stdout and stderr on a terminal (a console), else a pipe
+    std::vector<std::string> env;  // NAME=value set in the environment
+    std::string directory;         // where it starts; empty: ours
+    std::string shell;             // run first, as a careless parent leaves the start state
+    systems where = systems::both; // where a row of run_rows holds
+    bool as_root = false;          // a row of run_rows that holds only when we are root
 };
+inline const options on_linux{.where = systems::linux_only},
+    on_windows{.where = systems::windows_only};
 
 class daemon_run {
   public:
@@ -72,8 +76,6 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
 struct row {
     std::vector<std::string> args, steps;
     options how = {};
-    systems where = systems::both;
-    bool needs_root = false;
 };
 void run_rows(const std::vector<row>& rows);
 

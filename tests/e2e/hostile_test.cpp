@@ -28,38 +28,33 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         // out of descriptors: launches fail with the errno, the daemon serves on
         {child(many_channels),
          {"?failed to create child process.", "?failed 24", "!INT", "=0"},
-         {.shell = "ulimit -n 64"},
-         systems::linux_only},
-        // a working directory deleted under us: only a relative name is not found
+         {.shell = "ulimit -n 64", .where = systems::linux_only}},
+        // a working directory deleted under us (Windows keeps one that is in use):
+        // only a relative name is not found
         {{"-d", doomed.path, "--", child_binary, "execute", "!rmcwd", "+", "0", "./prog", "+", "0",
           "/bin/true", "+", "0", "true"},
          {"?child: rmcwd 0", "&executable './prog' not found.", "?child: 1 failed 2",
           "&child: 2 closed 0", "&child: 3 closed 0", "!INT", "=0"},
-         {},
-         systems::linux_only}, // Windows keeps a process's working directory
+         on_linux},
         // a grandchild holding the pipe does not hold back the channel's end (past the wait)
         {child({"execute", pipes, "/bin/sh", "-c", "sleep 12 & echo hi"}),
          {"?child: 1 stdout hi", "?child: 1 closed 0", "!INT", "=0"},
-         {},
-         systems::linux_only},
+         on_linux},
         // a peer that floods a child's stdin that is never read is held back
         {child({"flood-in", child_binary, "exit", "0", "3s"}),
          {"?child: flood-in held", "!INT", "=0"}},
         // input for a child that closed its stdin is dropped, and holds nothing back
         {{"--", child_binary, "flood-in", "/bin/sh", "-c", "exec sleep 3 0<&-"},
          {"?child: flood-in sent all", "!INT", "=0"},
-         {},
-         systems::linux_only},
+         on_linux},
         // a closed stdin at start: the child still gets fds 0, 1, 2 and its pipe
         {{"--", child_binary, "fds"},
          {"?child: fds clean", "!INT", "=0"},
-         {.shell = "exec 0<&-"},
-         systems::linux_only},
+         {.shell = "exec 0<&-", .where = systems::linux_only}},
         // an inherited SIGCHLD ignore must not hide exits from us
         {{"--", child_binary, "execute", "once", dir.path + "/failed", "0"},
          {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "!INT", "=0"},
-         {.shell = "trap '' CHLD"},
-         systems::linux_only},
+         {.shell = "trap '' CHLD", .where = systems::linux_only}},
         // Ctrl-C reaches the terminal's whole group; the child ends by sigterm, not by it
         {{"--", child_binary, "peer"},
          {"?child: ready", "!GROUP", "?child: sigterm", "?'test_child' exited with 0x0.", "=0",
@@ -67,12 +62,10 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         // Ctrl-Break and the console's close stop the children the same way
         {{"--", child_binary, "console-event", "1"},
          {"?stopping torvad", "?child: sigterm", "?'test_child' exited with 0x0.", "=0", "-again"},
-         {},
-         systems::windows_only},
+         on_windows},
         {{"--", child_binary, "console-event", "2"},
          {"?stopping torvad", "?child: sigterm", "?'test_child' exited with 0x0.", "=0"},
-         {},
-         systems::windows_only},
+         on_windows},
         // each item reaches the program whole: none of it can become an argument of its own
         {child({"execute", pipes, child_binary, "args", "a\\\" --delete-all", "C:\\dir\\", "x y",
                 "\\\\\"q\\", "", "t\tab", "\"", "\\", "\xc3\xa9\xe2\x82\xac", "end"}),
@@ -83,8 +76,7 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         // a batch file would have cmd.exe read its arguments: refused, by any spelling
         {child({"execute", "0", missing + ".bat", "+", "0", missing + ".CmD. "}),
          {"?refused to run '", "?child: 1 failed 193", "?child: 2 failed 193", "!INT", "=0"},
-         {},
-         systems::windows_only},
+         on_windows},
         // a program run at an attached peer's request can't write on the peer's pipe
         // and torvad never runs the command behind -a
         {child({"attach", torvad_binary, child_binary}),
@@ -95,7 +87,6 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {"?child: squat taken", "?failed to create ipc pipe.", "?failed to create ipc pipe.",
           "?its name taken by another program", "?child: 1 failed 5", "!INT", "=0",
           "-child: 1 opened"},
-         {},
-         systems::windows_only},
+         on_windows},
     });
 }
