@@ -16,7 +16,6 @@ const char* const stopping = "?stopping torvad version 1.1.21.0...";
 
 TEST(children, launch_exit_restart_and_stop) {
     scratch_dir dir, anyone; // a copy of the child that nobody may run from where nobody may be
-    notify_socket manager;
     const options root{.where = systems::linux_only, .as_root = true};
     const std::string copy = anyone.path + "/test_child"; // its rows hold on Linux alone
     std::filesystem::copy(child_file, copy);
@@ -74,7 +73,7 @@ TEST(children, launch_exit_restart_and_stop) {
     for (const auto& [marker, how] :
          {std::pair{"/orphaned", on_linux},
           {"/orphaned-too",
-           options{.terminal = false, .env = {manager.env()}, .where = systems::linux_only}}})
+           options{.terminal = false, .manager = true, .where = systems::linux_only}}})
         rows.push_back(
             {child({"orphans", "2", dir.path + marker}),
              {"?child: orphans made", "?'test_child' exited with 0x3.",

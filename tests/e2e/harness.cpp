@@ -12,6 +12,7 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <poll.h>
 #include <pty.h>
 #include <sys/ioctl.h>
@@ -94,6 +95,41 @@ void open_output(bool terminal, int& ours, int& theirs) {
     execvp(argv[0], argv.data());
     _exit(127);
 }
+
+// torvad's run: its pid, the output read so far, and a cursor behind the last match.
+struct daemon_run {
+    daemon_run(const std::vector<std::string>& args, const options& how);
+    ~daemon_run();
+    daemon_run(const daemon_run&) = delete;
+
+    // Reads until text appears behind the cursor, or anywhere (the cursor kept).
+    bool wait_for(const std::string& text, int timeout_ms = event_wait_ms);
+    bool wait_anywhere(const std::string& text);
+    // The exit code, or -1 when it didn't end in time (it is killed then).
+    int wait_exit(int timeout_ms = event_wait_ms);
+    // A stop request; Ctrl-C to its terminal's whole group.
+    void signal(int signal_number);
+    void interrupt_group();
+    bool read_some(int timeout_ms); // false when nothing came in time
+
+    int pid_ = -1, out_fd_ = -1, exit_code_ = -1;
+    bool console_, eof_ = false, exited_ = false;
+    std::string output_, drawn_; // drawn_: console bytes not yet told as text
+    std::size_t cursor_ = 0;
+};
+
+// The service manager's end: a datagram socket that torvad reports its states to.
+struct manager_socket {
+    scratch_dir dir;
+    int fd = bound_datagram_socket(dir.path + "/notify");
+    ~manager_socket() { close(fd); }
+    std::string next(int timeout_ms) { // "" when none comes in time
+        pollfd ready{fd, POLLIN, 0};
+        char message[256];
+        ssize_t got = poll(&ready, 1, timeout_ms) == 1 ? recv(fd, message, sizeof message, 0) : 0;
+        return std::string(message, got > 0 ? got : 0);
+    }
+};
 
 } // namespace
 
@@ -228,33 +264,47 @@ bool no_zombie_within(int pid, int timeout_ms) {
 } // namespace
 
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
-                  const options& how, const step_hook& hook) {
-    daemon_run run(args, how);
+                  const options& how) {
+    std::optional<manager_socket> manager;
+    options given = how;
+    if (how.manager)
+        given.env.push_back("NOTIFY_SOCKET=" + manager.emplace().dir.path + "/notify");
+    daemon_run run(args, given);
+    const std::string& out = run.output_;
     int child = -1;
     for (const auto& step : steps) {
         std::string text = step.substr(1);
-        if (hook && hook(step, run))
-            continue;
         if (step[0] == '?')
-            EXPECT_TRUE(run.wait_for(text)) << "waited for: " << text << "\n" << run.output();
+            EXPECT_TRUE(run.wait_for(text)) << "waited for: " << text << "\n" << out;
         else if (step == "!GROUP")
             run.interrupt_group();
+        else if (step == "!USR2")
+            kill(run.pid_, SIGUSR2);
         else if (step[0] == '!')
             run.signal(text == "INT" ? SIGINT : SIGTERM);
+        else if (step == "@*")
+            while (!manager->next(0).empty()) {
+            }
+        else if (step[0] == '@')
+            EXPECT_EQ(manager->next(text.empty() ? 0 : event_wait_ms), text) << out;
         else if (step[0] == '#')
-            child = run.wait_for(text + "=") ? std::atoi(run.at_cursor()) : -1;
+            child = run.wait_for(text + "=") ? std::atoi(out.c_str() + run.cursor_) : -1;
         else if (step.rfind("kill ", 0) == 0 && child > 0)
             kill(child, std::atoi(step.c_str() + 5));
+        else if (step[0] == 'P') // under Wine the pid is Windows', which we don't see
+            EXPECT_EQ(read_file(text),
+                      std::to_string(under_wine ? std::atoi(read_file(text).c_str()) : run.pid_) +
+                          "\n");
         else if (step[0] == '=')
-            EXPECT_EQ(run.wait_exit(), std::atoi(text.c_str())) << run.output();
+            EXPECT_EQ(run.wait_exit(), std::atoi(text.c_str())) << out;
         else if (step == "z")
-            EXPECT_TRUE(no_zombie_within(run.pid(), event_wait_ms)) << run.output();
+            EXPECT_TRUE(no_zombie_within(run.pid_, event_wait_ms)) << out;
         else if (step[0] == '&')
-            EXPECT_TRUE(run.wait_anywhere(text)) << "waited for: " << text << "\n" << run.output();
+            EXPECT_TRUE(run.wait_anywhere(text)) << "waited for: " << text << "\n" << out;
         else if (step[0] == '+')
-            EXPECT_NE(run.output().find(text), std::string::npos) << text << "\n" << run.output();
+            EXPECT_NE(out.find(text), std::string::npos) << text << "\n" << out;
         else if (step[0] == '-')
-            EXPECT_EQ(run.output().find(text), std::string::npos) << text << "\n" << run.output();
+            EXPECT_EQ(out.find(text), std::string::npos) << text << "\n" << out;
         else
             ADD_FAILURE() << "bad step " << step;
     }
@@ -278,33 +328,6 @@ scratch_dir::scratch_dir() : path(std::filesystem::temp_directory_path() / "torv
 scratch_dir::~scratch_dir() {
     std::error_code ignored;
     std::filesystem::remove_all(path, ignored);
-}
-
-notify_socket::notify_socket() : fd(bound_datagram_socket(dir.path + "/notify")) {}
-
-notify_socket::~notify_socket() {
-    close(fd);
-}
-
-std::string notify_socket::next(int timeout_ms) {
-    pollfd ready{fd, POLLIN, 0};
-    char message[256];
-    ssize_t got = poll(&ready, 1, timeout_ms) == 1 ? recv(fd, message, sizeof message, 0) : 0;
-    return std::string(message, got > 0 ? got : 0);
-}
-
-step_hook notify_socket::steps() {
-    return [this](const std::string& step, daemon_run& run) {
-        if (step == "!USR2") {
-            kill(run.pid(), SIGUSR2);
-        } else if (step == "@*") {
-            while (!next(0).empty()) {
-            }
-        } else if (step[0] == '@') {
-            EXPECT_EQ(next(), step.substr(1)) << run.output();
-        }
-        return step == "!USR2" || step[0] == '@';
-    };
 }
 
 std::vector<std::string> child(std::vector<std::string> mode, std::vector<std::string> options) {

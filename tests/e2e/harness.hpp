@@ -1,10 +1,8 @@
 // Runs the real torvad binary for end-to-end tests: stdout on a terminal (the
-// console path) or on a pipe (the service path), with bounded waits for what
-// it prints and for its exit. The same tests drive the Windows build under
-// Wine when TORVAD_WINDOWS_BUILD names its folder.
+// console path) or on a pipe (the service path). The same tests drive the
+// Windows build under Wine when TORVAD_WINDOWS_BUILD names its folder.
 #pragma once
 
-#include <functional>
 #include <string>
 #include <vector>
 
@@ -27,50 +25,27 @@ struct options {
     std::vector<std::string> env;  // NAME=value set in the environment
     std::string directory;         // where it starts; empty: ours
     std::string shell;             // run first, as a careless parent leaves the start state
+    bool manager = false;          // a service manager of the test's own on NOTIFY_SOCKET
     systems where = systems::both; // where a row of run_rows holds
     bool as_root = false;          // a row of run_rows that holds only when we are root
 };
 inline const options on_linux{.where = systems::linux_only},
     on_windows{.where = systems::windows_only};
 
-class daemon_run {
-  public:
-    daemon_run(const std::vector<std::string>& args, const options& how = {});
-    ~daemon_run();
-    daemon_run(const daemon_run&) = delete;
-
-    // Reads until text appears behind the cursor, or anywhere (the cursor kept).
-    bool wait_for(const std::string& text, int timeout_ms = event_wait_ms);
-    bool wait_anywhere(const std::string& text);
-    // The exit code, or -1 when it didn't end in time (it is killed then).
-    int wait_exit(int timeout_ms = event_wait_ms);
-    // A stop request: the signal, or under Wine Ctrl-C typed at the console;
-    // Ctrl-C to its terminal's whole group.
-    void signal(int signal_number);
-    void interrupt_group();
-    int pid() const { return pid_; }
-    const char* at_cursor() const { return output_.c_str() + cursor_; }
-    const std::string& output() const { return output_; }
-
-  private:
-    bool read_some(int timeout_ms); // false when nothing came in time
-    int pid_ = -1, out_fd_ = -1, exit_code_ = -1;
-    bool console_, eof_ = false, exited_ = false;
-    std::string output_, drawn_; // drawn_: console bytes not yet told as text
-    std::size_t cursor_ = 0;
-};
-
-// Runs torvad with args through steps, each a check or an action:
+// Runs torvad with args through steps, each a check or an action, with
+// bounded waits for what it prints and for its exit:
 //   "?text" waits for text behind the last match    "!INT" / "!TERM" signals torvad
 //   "#key"  takes the pid behind "key=" as the child "kill N" sends signal N to it
 //   "=N"    expects exit code N                     "-text" text never appears
 //   "+text" text appears anywhere                    "&text" waits for text anywhere
 //   "z"     within the bound, no child of torvad is a zombie
 //   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
-// A test's own steps, tried before those above; true when it took the step.
-using step_hook = std::function<bool(const std::string& step, daemon_run& run)>;
+//   "Ppath" the file at path holds torvad's pid and a line feed
+// With a manager: "@message" expects its next report, "@*" drops those still
+// unread, "@" expects none, "!USR2" sends torvad a SIGUSR2.
+// Under Wine every stop request is Ctrl-C typed at the console.
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
-                  const options& how = {}, const step_hook& hook = {});
+                  const options& how = {});
 
 // A row of a scenario table; run_rows runs those that hold here.
 struct row {
@@ -84,19 +59,6 @@ struct scratch_dir {
     scratch_dir();
     ~scratch_dir();
     std::string path;
-};
-
-// The service manager's end on Linux: a datagram socket that torvad reports
-// its states to. As steps: "@message" expects the next report, "@*" drops
-// those still unread, "!USR2" sends torvad a SIGUSR2.
-struct notify_socket {
-    notify_socket();
-    ~notify_socket();
-    std::string next(int timeout_ms = 10000); // "" when none comes in time
-    std::string env() const { return "NOTIFY_SOCKET=" + dir.path + "/notify"; }
-    step_hook steps();
-    scratch_dir dir;
-    int fd;
 };
 
 // torvad's arguments for the test child in a mode: options, "--", the child, mode.

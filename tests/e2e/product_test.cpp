@@ -84,11 +84,10 @@ TEST_F(product, service_path_reports_its_states_and_ends_children_in_order) {
     for (auto [args, steps] : rows) {
         SCOPED_TRACE(::testing::PrintToString(args));
         scratch_dir dir;
-        notify_socket manager;
         args.insert(args.begin(), {"-p", dir.path + "/pid", "-d", dir.path});
-        run_scenario(args, steps, {.terminal = false, .env = {manager.env()}}, manager.steps());
+        steps.push_back("@");
+        run_scenario(args, steps, {.terminal = false, .manager = true});
         EXPECT_FALSE(file_exists(dir.path + "/pid"));
-        EXPECT_EQ(manager.next(0), "");
     }
 }
 

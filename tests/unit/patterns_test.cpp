@@ -114,7 +114,6 @@ TEST(patterns, check_names_skipped_lines_and_warns) {
 // line that permitted, or the refusal with every line tried.
 TEST(patterns, explain_names_the_deciding_line_or_every_line_tried) {
     const std::string demo = "# own\nuname\\0-[a-z]+\n(all) id\\0-un\n";
-    const std::string longest(65520 - 11, 'y'); // a whole packet behind "/bin/echo\0x"
     const std::tuple<std::string, std::vector<std::string>, std::string, int> rows[] = {
         {demo, {"--", "uname", "-a"}, "permitted by line 2: uname\\0-[a-z]+\n", 0},
         {demo,
@@ -127,11 +126,8 @@ TEST(patterns, explain_names_the_deciding_line_or_every_line_tried) {
          "refused: permission to change user denied\n    line 3 (no match): (all) id\\0-un\n",
          13},
         {demo, {"-u", "nobody", "--", "id", "-un"}, "permitted by line 3: (all) id\\0-un", 0},
-        {"(\n/bin/true\n", {"--", "("}, "denied\n    line 2 (no match): /bin/true\n", 13},
-        {"([^\\0]*)\\0\\1\n", {"--", "/bin/echo", "/bin/echo"}, "permitted by line 1", 0},
-        {"/bin/echo\\0x.*\n", {"--", "/bin/echo", "x" + longest}, "permitted by line 1", 0},
         {"/bin/echo\\0x(y|y)*\\1z\n",
-         {"--", "/bin/echo", "x" + longest},
+         {"--", "/bin/echo", "x" + std::string(40, 'y')},
          "refused: undecided within the bounds\n    line 1 (undecided)",
          13},
         {demo, {"-u", "--", "id"}, "", -1},
