@@ -13,9 +13,8 @@ namespace child_host {
 
 void prepare_streams() {}
 
-// Rows ask for a clean start: exactly fds 0, 1, 2 and the ipc end (a leak
-// takes the lowest free numbers), no blocked or ignored signal; and for the
-// account that -u or core's script named.
+// A clean start is exactly fds 0, 1, 2 and the ipc end (a leak takes the lowest
+// free numbers), and no blocked or ignored signal; then the account.
 std::vector<std::string> start_state(int ipc_fd) {
     std::string fds, ignored, groups;
     for (int fd = 0; fd < 1024; ++fd)
@@ -40,8 +39,7 @@ std::vector<std::string> start_state(int ipc_fd) {
                 " groups=" + groups};
 }
 
-// Each orphan, once its parent has gone, reports who adopted it, and ends
-// when the pipe's last writer does (the supervised child).
+// Each orphan ends when the pipe's last writer does: the supervised child.
 bool leave_orphans(int count) {
     int fds[2];
     if (pipe(fds) == -1)

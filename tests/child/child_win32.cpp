@@ -21,8 +21,7 @@ void prepare_streams() {
     SetConsoleCtrlHandler([](DWORD event) -> BOOL { return event == CTRL_BREAK_EVENT; }, TRUE);
 }
 
-// Which handles a process holds can't be listed here, and no row asks after
-// the account.
+// A process's handles can't be listed here, and no row asks after the account.
 std::vector<std::string> start_state(int) {
     return {};
 }
@@ -70,9 +69,7 @@ bool console_event(int n) {
     return thread != nullptr && CloseHandle(thread);
 }
 
-// schtasks and powershell append what follows the program on their command
-// line, as the line holds it, to <tool>.log in the working directory;
-// powershell then prints the script behind -file, and fails when there is none.
+// A named pipe: torvad reads it overlapped, which an anonymous pipe can't be.
 bool start_attached(const std::string& torvad, int& ours, long& theirs) {
     std::string name = "\\\\.\\pipe\\torvad_caller_" + std::to_string(GetCurrentProcessId());
     HANDLE server =
@@ -98,6 +95,9 @@ bool start_attached(const std::string& torvad, int& ours, long& theirs) {
     return true;
 }
 
+// schtasks and powershell append their command line behind the program, as the
+// line holds it, to <tool>.log here; powershell then prints the script behind
+// -file, and fails when there is none.
 int stand_in_for_tool(const char* self) {
     std::string tool = std::filesystem::path(self).stem().string(), line = GetCommandLineA();
     if (tool != "schtasks" && tool != "powershell")

@@ -58,8 +58,8 @@ bool greet(connection& link) {
     return true;
 }
 
-// Ends 0 at sigterm; a deaf peer ignores the first and, as if it had been
-// killed, ends 137 at the second, so that no row needs to kill it.
+// Ends 0 at sigterm; a deaf peer ignores the first and ends 137 at the second,
+// as if killed, so that no row needs to kill it.
 int await_sigterm(connection& link, bool deaf = false) {
     peer::packet packet;
     for (int heard = 0; link.receive(packet);)
@@ -86,8 +86,7 @@ int mode_fds(const context& how) {
     return serve(how);
 }
 
-// A peer whose report goes to the file FILE, for a run with no console to
-// write to (a service): its version, then its sigterm.
+// A peer reporting its version, then its sigterm, to file: a service has no console.
 int record(const std::string& file, int ipc_fd) {
     std::ofstream report(file, std::ios::app | std::ios::binary);
     connection link(ipc_fd);
@@ -101,14 +100,11 @@ int record(const std::string& file, int ipc_fd) {
     return 4;
 }
 
-// Sends one execute per request, on channels 1, 2, ...; each request is its
-// flags, then its items, and "+" separates requests. "!rmcwd" instead removes
-// the working directory; the requests between two "!rmcwd" go out in one
-// write, as a peer that pipelines sends them. Reports each opened, stdout and
-// end per channel.
-// Led by "once MARKER OPENS", the first time (no MARKER yet) it waits for
-// OPENS opened packets instead and exits 3, leaving its channels behind;
-// started again, it serves ("once-deaf": deaf to the first sigterm).
+// Sends one execute per request, "FLAGS ITEMS...", "+" between requests, on
+// channels 1, 2, ..., pipelined in one write up to an "!rmcwd", which removes
+// the working directory; reports each opened, stdout and end. Led by "once
+// MARKER OPENS", the first time it exits 3 once OPENS channels opened, leaving
+// them behind; started again, it serves ("once-deaf": deaf to one sigterm).
 int mode_execute(const context& how) {
     bool once = how.args.size() > 2 && how.args[0].starts_with("once");
     if (once && !create_once(how.args[1]))
@@ -157,10 +153,9 @@ int main(int argc, char** argv) {
     if (int code = child_host::stand_in_for_tool(argv[0]); code >= 0)
         return code;
     context how{{}, peer::ipc_fd_from_arguments(argc, argv)};
-    // Named core (core.exe), it stands in for the product's server program: it
-    // answers -h with its version on stderr (a file "silent" keeps that back);
-    // it records to a file "core.log" that is there (a run with no console),
-    // or else reports as the fds mode does.
+    // Named core, it is the product's server program: -h gives its version on
+    // stderr (unless a file "silent" is there); it records to "core.log" when
+    // that is there (no console), or else reports as the fds mode does.
     bool core = fs::path(argv[0]).stem() == "core";
     if (core && argc > 1 && std::string_view(argv[1]) == "-h")
         return std::fputs(fs::exists("silent") ? "usage: core\n" : "test_child version 1\n",
@@ -178,8 +173,7 @@ int main(int argc, char** argv) {
         return mode_fds(how);
     if (mode == "execute")
         return mode_execute(how);
-    // Each argument in brackets, as the program got it; a byte that a console
-    // would draw otherwise as \xHH.
+    // Each argument in brackets, as the program got it, unprintable bytes as \xHH.
     if (mode == "args") {
         std::string line;
         char hex[5];
@@ -213,20 +207,17 @@ int main(int argc, char** argv) {
     // Speaks as torvad on the ipc fd it was given: output of channel 9.
     if (mode == "forge")
         return connection(how.ipc_fd).send(9, packet_stdout, 0, "forged") ? 0 : 1;
-    // "orphans N MARKER": the first time, leaves N orphans behind, which end
-    // together with us as we exit with 3; started again, serves.
+    // "orphans N MARKER": the first time, exits 3 leaving N orphans; then serves.
     if (mode == "orphans" && (how.args.size() < 2 || !create_once(how.args[1])))
         return serve(how);
     if (mode == "orphans")
         return child_host::leave_orphans(how.number(0)) ? (say("orphans made"), 3) : 1;
-    // "squat N ...": takes the name of torvad's ipc pipe number N first, then
-    // sends the requests behind N as the execute mode does.
+    // "squat N ...": takes the name of torvad's ipc pipe N, then executes the rest.
     if (mode == "squat")
         return say(child_host::take_pipe_name(how.number(0)) ? "squat taken" : "squat failed"),
                mode_execute({{how.args.begin() + 1, how.args.end()}, how.ipc_fd});
-    // "attach TORVAD CHILD": makes a pipe and starts TORVAD on its far end, as
-    // a caller of -a does; as the peer, has it run CHILD forging on that end,
-    // with pipes, so that the launch passes handles on at all.
+    // "attach TORVAD CHILD": starts TORVAD with -a on a pipe of ours and has it
+    // run CHILD forging on that pipe's far end, with pipes, so that handles pass.
     int ours = -1;
     long theirs = -1;
     if (mode == "attach" && child_host::start_attached(how.args.at(0), ours, theirs)) {

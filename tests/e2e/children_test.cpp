@@ -101,13 +101,11 @@ TEST(children, a_requester_s_end_closes_the_pipes_of_its_channels) {
         {left[0], left[1], "+starting 'sh' again.", "?'sh' exited with 0x0.", "!INT", "=0"});
 }
 
-// A channel outlives its requester; at the stop it has no living parent, so
-// it is ended by force and that end counts as 0. The requester ignores
-// sigterm, so the run lasts until that end is seen. A channel holds no
-// descriptor of its requester's.
+// A channel outlives its requester and holds none of its descriptors; at the
+// stop, with no living parent, it is ended by force, which counts as 0. The
+// requester is deaf to sigterm, so the run lasts until that end is seen.
 TEST(children, an_orphaned_channel_is_ended_by_force_at_the_stop) {
-    // Under Wine this row timed out once in several runs, at the stop; until
-    // that is understood it holds on Linux only.
+    // Under Wine it timed out at the stop once in several runs, not yet understood.
     if (!holds_here(systems::linux_only))
         GTEST_SKIP() << "times out now and then under Wine";
     scratch_dir dir;

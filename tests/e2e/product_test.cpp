@@ -1,8 +1,7 @@
-// The product as the service manager and an installation see it on Linux: the
-// service path's state reports on a real NOTIFY_SOCKET, and the start of the
-// server family or web service with stub programs on PATH that record their
-// arguments. The hand-over to a silent core is checked byte for byte under
-// Wine, and done for real under systemd by the system suite.
+// The product on Linux: the service path's reports to the manager, and the
+// start of the server family or web service with stubs on PATH that record
+// their arguments. The hand-over to a silent core is checked byte for byte
+// under Wine, and done for real by the systemd suite.
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -124,9 +123,8 @@ TEST_F(product, server_family_start_takes_core_account_from_init_script) {
     }
 }
 
-// What runs where: core wins over wfe; wfe alone runs as the local service
-// account; core runs under the account the init script names, as its own
-// report from inside shows.
+// core wins over wfe; wfe runs as the local service account; core runs as the
+// account the init script names, as it reports itself.
 TEST_F(product, the_working_directory_decides_what_is_supervised) {
     const std::pair<std::vector<std::string>, std::vector<std::string>> rows[] = {
         {{"core", "wfe"}, {core_ran, "=0", "-wfe runs"}},

@@ -1,8 +1,6 @@
-// The product on Windows, under Wine: the server family's start with copies of
-// the test child standing in for core.exe, powershell.exe and schtasks.exe
-// (each acts by its name and logs its command line), the event log, whose
-// records Wine writes to its debug channel, and the service path under Wine's
-// service control manager.
+// The product on Windows, under Wine: the test child stands in for core.exe,
+// powershell.exe and schtasks.exe, acting by its name; Wine writes the event
+// log's records to its debug channel; sc.exe drives the service path.
 #include <gtest/gtest.h>
 
 #include <boost/process.hpp>
@@ -56,10 +54,8 @@ bool becomes_true(const std::function<bool()>& condition) {
 } // namespace
 
 // The init script's command line, byte for byte; what its output decides is
-// the same on both systems and checked on Linux. Wine can't run core under an
-// account the script names (its LogonUserA hands out a token that no other
-// call takes), so the script names none. Ctrl-C reaches core too: it must be
-// ready to ignore it.
+// checked on Linux (Wine's LogonUserA gives a token that no other call takes).
+// Ctrl-C reaches core too, which ignores it.
 TEST(windows, server_family_start_runs_the_init_script_then_core) {
     if (!under_wine)
         GTEST_SKIP() << "the Windows build under Wine";
@@ -95,9 +91,8 @@ TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
                   "/tn startts\"\"\"\n/run /tn startts\n");
 }
 
-// Wine's event log is a stub that writes the calls and each record's strings
-// to its debug channels: the source is registered once, and a record has the
-// level's type, category 0, event 0, no user, two strings and no data.
+// The source is registered once; a record has the level's type, category 0,
+// event 0, no user, two strings and no data.
 TEST(windows, event_log_gets_one_record_per_line_with_source_and_type) {
     if (!under_wine)
         GTEST_SKIP() << "the Windows build under Wine";

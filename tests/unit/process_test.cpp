@@ -86,8 +86,7 @@ struct rig final : process_owner {
              ++turns)
             context.run_for(std::chrono::milliseconds(1));
     }
-    // Runs the loop until count packets of type have come on channel, or
-    // until done() (bounded).
+    // Runs the loop until count packets of type came on channel, or done() (bounded).
     bool read_until(std::uint32_t channel, std::uint32_t type, long count = 1) {
         return read_until([&] {
             return std::count_if(packets.begin(), packets.end(), [&](const auto& p) {
@@ -112,8 +111,7 @@ struct rig final : process_owner {
         }
         return done();
     }
-    // What came on channel: its output as text, the rest by type name, an
-    // end with its status.
+    // What came on channel: output as text, the rest as <type:flags>.
     std::string story(std::uint32_t channel) const {
         std::string text;
         for (const auto& [h, payload] : packets)
@@ -149,10 +147,9 @@ TEST(process, a_channel_ends_after_its_output_and_frees_its_id_at_once) {
                                                   "channel 0x1 does not exist"}));
 }
 
-// A requester that doesn't read holds its channel's output back: the child
-// blocks on its full pipe instead of torvad holding megabytes. A child that
-// ended meanwhile, its last output still in its pipe, has that sent too. Once
-// the peer reads again every byte arrives, in order, before closed.
+// A requester that doesn't read holds its channel's output back in the child's
+// full pipe, not in torvad; a child that ended meanwhile still has its output
+// sent. Once the peer reads, every byte arrives, in order, before closed.
 TEST(process, output_waits_for_a_requester_that_does_not_read) {
     for (auto [size, ends_unread] : {std::pair{std::size_t(1) << 20, false}, {300u << 10, true}}) {
         rig peer(false, 4096);
@@ -165,8 +162,7 @@ TEST(process, output_waits_for_a_requester_that_does_not_read) {
     }
 }
 
-// A request of the largest size that no line decides within the bound is
-// refused, and the log says why.
+// The largest request, undecided within the bound: refused, and the log says why.
 TEST(process, a_request_undecided_within_the_bound_is_refused) {
     rig peer;
     std::vector<skipped_line> skipped;
@@ -241,10 +237,9 @@ TEST(process, a_channel_relays_its_standard_streams_in_order) {
     EXPECT_EQ(peer.log, std::vector<std::string>{"channel 0x8 standard input is not available"});
 }
 
-// Bytes of packets split across reads and joined in one are framed in order;
-// a length that can't be trusted drops every byte held, whole packets too.
-// Each row's pieces reach the pipe in separate reads; under -v every packet
-// is traced.
+// Packets split across reads (each piece one read) or joined in one are framed
+// in order, and traced under -v; a length that can't be trusted drops every
+// byte held, whole packets too.
 TEST(process, packets_are_framed_across_reads_and_traced) {
     const std::string stdin5 = packet_bytes(5, packet_stdin, 0, "abc"),
                       stdin6 = packet_bytes(6, packet_stdin, stdin_close, "x");
