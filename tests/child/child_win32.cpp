@@ -6,7 +6,6 @@
 #include <filesystem>
 #include <fstream>
 #include <io.h>
-#include <iostream>
 
 #include "tests/child/child_host.hpp"
 
@@ -96,8 +95,7 @@ bool start_attached(const std::string& torvad, int& ours, long& theirs) {
 }
 
 // schtasks and powershell append their command line behind the program, as the
-// line holds it, to <tool>.log here; powershell then prints the script behind
-// -file, and fails when there is none.
+// line holds it, to <tool>.log here.
 int stand_in_for_tool(const char* self) {
     std::string tool = std::filesystem::path(self).stem().string(), line = GetCommandLineA();
     if (tool != "schtasks" && tool != "powershell")
@@ -105,13 +103,7 @@ int stand_in_for_tool(const char* self) {
     std::size_t end = line[0] == '"' ? line.find('"', 1) + 1 : line.find(' ');
     std::ofstream(tool + ".log", std::ios::app | std::ios::binary)
         << (end >= line.size() ? "" : line.substr(end + 1)) << "\n";
-    for (int i = 1; tool == "powershell" && i + 1 < __argc; ++i)
-        if (std::string(__argv[i]) == "-file") {
-            std::ifstream script(__argv[i + 1], std::ios::binary);
-            std::cout << script.rdbuf();
-            return script ? 0 : 1;
-        }
-    return tool == "powershell";
+    return 0;
 }
 
 } // namespace child_host

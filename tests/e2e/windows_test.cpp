@@ -1,6 +1,7 @@
 // The product on Windows, under Wine: the test child stands in for core.exe,
 // powershell.exe and schtasks.exe, acting by its name; Wine writes the event
-// log's records to its debug channel; sc.exe drives the service path.
+// log's records to its debug channel; sc.exe drives the service path. The
+// init script's command line is built as schtasks' is, and run as on Linux.
 #include <gtest/gtest.h>
 
 #include <boost/process.hpp>
@@ -20,7 +21,7 @@ namespace {
 // as core.exe, and the given tool stand-ins in a folder in front of PATH.
 struct installation {
     explicit installation(std::vector<std::string> tools) {
-        std::filesystem::create_directories(product + "/scripts");
+        std::filesystem::create_directories(product);
         std::filesystem::create_directories(bin);
         tools.push_back("../my product/core.exe");
         for (const auto& tool : tools)
@@ -52,23 +53,6 @@ bool becomes_true(const std::function<bool()>& condition) {
 }
 
 } // namespace
-
-// The init script's command line, byte for byte; what its output decides is
-// checked on Linux (Wine's LogonUserA gives a token that no other call takes).
-// Ctrl-C reaches core too, which ignores it.
-TEST(windows, server_family_start_runs_the_init_script_then_core) {
-    if (!under_wine)
-        GTEST_SKIP() << "the Windows build under Wine";
-    installation site({"powershell.exe"});
-    std::ofstream(site.product + "/scripts/init.ps1", std::ios::binary) << "";
-    run_scenario({"-d", site.product},
-                 {"?child: ready", "!INT", "?child: sigterm", "?'core' exited with 0x0.", "=0",
-                  "-deelevate"},
-                 {.env = site.env});
-    EXPECT_EQ(site.log("powershell.log"),
-              "-noprofile -noninteractive -executionpolicy bypass -file \"" +
-                  windows_form(site.product) + "\\.\\scripts\\init.ps1\" .\n");
-}
 
 // core stays silent on "version": the service is handed over to it, the task
 // scheduler gets its two command lines byte for byte, and torvad ends with 1,
