@@ -51,9 +51,10 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         {{"--", child_binary, "fds"},
          {"?child: fds clean", "!INT", "=0"},
          {.shell = "exec 0<&-", .where = systems::linux_only}},
-        // an inherited SIGCHLD ignore must not hide exits from us
+        // an inherited SIGCHLD ignore must not hide exits from us, nor leave zombies
         {{"--", child_binary, "execute", "once", dir.path + "/failed", "0"},
-         {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "!INT", "=0"},
+         {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "z", "!INT",
+          "?'test_child' exited with 0x0.", "=0"},
          {.shell = "trap '' CHLD", .where = systems::linux_only}},
         // Ctrl-C reaches the terminal's whole group; the child ends by sigterm, not by it
         {{"--", child_binary, "peer"},

@@ -90,8 +90,15 @@ TEST_F(product, service_path_reports_its_states_and_ends_children_in_order) {
     }
 }
 
-TEST_F(product, server_family_start_takes_core_account_from_init_script) {
-    const std::pair<const char*, std::vector<std::string>> rows[] = {
+// core runs under the account its init script names (the stub powershell's
+// output), and wins over wfe; wfe alone runs as the local service account and
+// runs no script.
+TEST_F(product, the_program_here_starts_with_its_account) {
+    struct row {
+        const char* script; // the stub powershell's body; none when null
+        std::vector<std::string> steps, programs = {"core"};
+    };
+    const row rows[] = {
         {"printf 'no_such\\ruser\\r\\nnobody\\n'",
          {"?Failed to logon as user 'no_suchuser': error 2", "=0", "-deelevate"}},
         {"echo root; exit 3",
@@ -105,11 +112,20 @@ TEST_F(product, server_family_start_takes_core_account_from_init_script) {
         // a megabyte on one line, then more: cut, never blocking
         {"head -c 1048576 /dev/zero | tr '\\0' x; echo; seq 100000",
          {"?Failed to logon as user 'xxxxxxxx", "=0"}},
+        {"", {core_ran, "=0", "-wfe runs"}, {"core", "wfe"}},
+        {"",
+         geteuid() == 0
+             ? std::vector<std::string>{"?wfe runs as nobody", "?'wfe' exited with 0x0.", "=0"}
+             : std::vector<std::string>{"?Failed to logon as user 'NT Authority\\LocalService'",
+                                        "=0"},
+         {"wfe"}},
     };
-    for (const auto& [script, steps] : rows) {
+    for (const auto& [script, steps, programs] : rows) {
         SCOPED_TRACE(script ? script : "no powershell");
         installation site;
-        site.stub("/my product/core", answers_version);
+        for (const auto& program : programs)
+            site.stub("/my product/" + program,
+                      program == "core" ? answers_version : "echo wfe runs as $(id -un)");
         if (script)
             site.stub("/bin/powershell", script);
         if (steps.back().starts_with("+failed to open patterns"))
@@ -117,36 +133,9 @@ TEST_F(product, server_family_start_takes_core_account_from_init_script) {
         site.env.push_back("NOTIFY_SOCKET=/run/x");
         run_scenario({"-d", site.product}, steps, {.env = site.env});
         EXPECT_EQ(site.log("powershell"),
-                  script ? "-noprofile\n-noninteractive\n-executionpolicy\nbypass\n-file\n" +
-                               site.product + "/./scripts/init.ps1\n.\n---\n"
-                         : "");
-    }
-}
-
-// core wins over wfe; wfe runs as the local service account; core runs as the
-// account the init script names, as it reports itself.
-TEST_F(product, the_working_directory_decides_what_is_supervised) {
-    const std::pair<std::vector<std::string>, std::vector<std::string>> rows[] = {
-        {{"core", "wfe"}, {core_ran, "=0", "-wfe runs"}},
-        {{"wfe"},
-         geteuid() == 0
-             ? std::vector<std::string>{"?wfe runs as nobody", "?'wfe' exited with 0x0.", "=0"}
-             : std::vector<std::string>{"?Failed to logon as user 'NT Authority\\LocalService'",
-                                        "=0"}},
-        {{"test_child"}, {"?child: uid=65534 gid=65534", "!INT", "?child: sigterm", "=0"}},
-    };
-    for (const auto& [programs, steps] : rows) {
-        if (programs[0] == "test_child" && geteuid() != 0)
-            continue;
-        SCOPED_TRACE(programs.back());
-        installation site;
-        site.stub("/bin/powershell", programs[0] == "test_child" ? "printf 'nobody\\r\\n'" : "");
-        for (const auto& program : programs)
-            if (program == "test_child")
-                std::filesystem::copy(child_file, site.product + "/core");
-            else
-                site.stub("/my product/" + program,
-                          program == "core" ? answers_version : "echo wfe runs as $(id -un)");
-        run_scenario({"-d", site.product}, steps, {.env = site.env});
+                  script && programs[0] == "core"
+                      ? "-noprofile\n-noninteractive\n-executionpolicy\nbypass\n-file\n" +
+                            site.product + "/./scripts/init.ps1\n.\n---\n"
+                      : "");
     }
 }

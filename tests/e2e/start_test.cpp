@@ -17,11 +17,24 @@ TEST(start, options_help_and_the_pid_file) {
     scratch_dir dir, elsewhere;
     const std::string pid = dir.path + "/pid", ok = std::string("?") + started;
     const char* const no_pid_file = "-failed to create pid file";
+    const char* const debug = "WINEDEBUG=fixme+advapi,+eventlog";
+    const std::string record = ",0x0000,0x00000000,0000000000000000,0x0002,0x00000000,";
     run_rows({
         {{}, {ok, "=0", no_pid_file}},
         {{"-d"}, {ok, "=0", no_pid_file}},
         {{"-a", "garbage", "-d", "/no/such/dir", "stray", "-zz", "-"}, {ok, "=0", no_pid_file}},
-        {{"-p", dir.path + "/missing/pid"}, {ok, "=0", "+failed to create pid file"}},
+        // -l: each line is also a record of the event log, which Wine writes to
+        // its debug channel: the source registered once; the level's type,
+        // category 0, event 0, no user, two strings, no data. Without -l, none.
+        {{"-l", "-p", dir.path + "/missing/pid"},
+         {"?failed to create pid file", ok, "=0", "+RegisterEventSourceA ((null),\"torvad\")",
+          "+,0x0001" + record, "+err:eventlog:ReportEventW L\"torvad\"\n",
+          "+err:eventlog:ReportEventW L\"failed to create pid file\"\n", "+,0x0004" + record,
+          "+trace:eventlog:ReportEventW L\"" + std::string(started) + "\"\n"},
+         {.env = {debug}, .where = systems::windows_only}},
+        {{"-p", dir.path + "/missing/pid"},
+         {ok, "=0", "+failed to create pid file", "-EventSource"},
+         {.env = {debug}}},
         {{"-f", "family", "-u", "nobody", "--"}, {ok, "=0", no_pid_file}},
         {{"-a", "4242"}, {"?failed to attach to ipc pipe.", "?executable not specified", "=0"}},
         // a relative PID file name is taken in the starting directory, whatever -d says

@@ -1,7 +1,7 @@
 // The product on Windows, under Wine: the test child stands in for core.exe,
-// powershell.exe and schtasks.exe, acting by its name; Wine writes the event
-// log's records to its debug channel; sc.exe drives the service path. The
-// init script's command line is built as schtasks' is, and run as on Linux.
+// powershell.exe and schtasks.exe, acting by its name; sc.exe drives the
+// service path. The init script's command line is built as schtasks' is, and
+// run as on Linux.
 #include <gtest/gtest.h>
 
 #include <boost/process.hpp>
@@ -73,25 +73,6 @@ TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
                   windows_form(site.product) +
                   R"(\core.exe\\""; sc.exe start torvaSentryServer; schtasks.exe /delete /f )"
                   "/tn startts\"\"\"\n/run /tn startts\n");
-}
-
-// The source is registered once; a record has the level's type, category 0,
-// event 0, no user, two strings and no data.
-TEST(windows, event_log_gets_one_record_per_line_with_source_and_type) {
-    if (!under_wine)
-        GTEST_SKIP() << "the Windows build under Wine";
-    const std::vector<std::string> debug = {"WINEDEBUG=fixme+advapi,+eventlog"};
-    const std::string record = ",0x0000,0x00000000,0000000000000000,0x0002,0x00000000,";
-    run_scenario(
-        {"-l", "-p", "/no/such/dir/pid"},
-        {"?failed to create pid file", "?successfully started", "=0",
-         "+RegisterEventSourceA ((null),\"torvad\")", "+,0x0001" + record,
-         "+err:eventlog:ReportEventW L\"torvad\"\n",
-         "+err:eventlog:ReportEventW L\"failed to create pid file\"\n", "+,0x0004" + record,
-         "+trace:eventlog:ReportEventW L\"successfully started torvad version 1.1.21.0\"\n"},
-        {.env = debug});
-    run_scenario({"-p", "/no/such/dir/pid"}, {"?successfully started", "=0", "-EventSource"},
-                 {.env = debug});
 }
 
 // Created, started, queried and stopped with sc.exe, as an installation runs
