@@ -94,7 +94,7 @@ TEST(children, a_requester_s_end_closes_the_pipes_of_its_channels) {
     run_scenario(
         child(
             {"execute", "once", dir.path + "/left-sh", "2", "3", "sh", "-c", once + "; exec cat"}),
-        {left[0], left[1], "+starting 'sh' again.", "?'sh' exited with 0x0.", "!INT", "=0"});
+        {left[0], left[1], "&starting 'sh' again.", "?'sh' exited with 0x0.", "!INT", "=0"});
 }
 
 // A channel outlives its requester and holds none of its descriptors; at the

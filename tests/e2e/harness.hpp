@@ -37,7 +37,7 @@ inline const options on_linux{.where = systems::linux_only},
 //   "?text" waits for text behind the last match    "!INT" / "!TERM" signals torvad
 //   "#key"  takes the pid behind "key=" as the child "kill N" sends signal N to it
 //   "=N"    expects exit code N                     "-text" text never appears
-//   "+text" text appears anywhere                    "&text" waits for text anywhere
+//   "&text" waits for text anywhere
 //   "z"     within the bound, no child of torvad is a zombie
 //   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
 //   "Ppath" the file at path holds torvad's pid and a line feed

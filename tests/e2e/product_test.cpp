@@ -61,7 +61,7 @@ TEST_F(product, service_path_reports_its_states_and_ends_children_in_order) {
         {child({"fds"}),
          {"@STATUS=starting", running_1, "?successfully started", "?child: ready", "!USR2", "!TERM",
           stopping_1, "?child: sigterm", "?'test_child' exited with 0x0.", "@STATUS=stopped",
-          "!TERM", "=0", "-\x1b", "+child: fds clean", "-notify socket"}},
+          "!TERM", "=0", "-\x1b", "&child: fds clean", "-notify socket"}},
         // a stop during the start: the first run returns at once, the second
         // still ends the child through its sigterm
         {child({"peer"}),
@@ -108,7 +108,7 @@ TEST_F(product, the_program_here_starts_with_its_account) {
         {"echo $NOTIFY_SOCKET", {core_ran, "=0", "-deelevate", "-failed to open patterns"}},
         // exec.patterns there (a socket file) but unreadable
         {"printf '\\r\\r\\n'",
-         {core_ran, "=0", "-Failed to logon", "+failed to open patterns file 'exec.patterns'"}},
+         {core_ran, "=0", "-Failed to logon", "&failed to open patterns file 'exec.patterns'"}},
         // a megabyte on one line, then more: cut, never blocking
         {"head -c 1048576 /dev/zero | tr '\\0' x; echo; seq 100000",
          {"?Failed to logon as user 'xxxxxxxx", "=0"}},
@@ -128,7 +128,7 @@ TEST_F(product, the_program_here_starts_with_its_account) {
                       program == "core" ? answers_version : "echo wfe runs as $(id -un)");
         if (script)
             site.stub("/bin/powershell", script);
-        if (steps.back().starts_with("+failed to open patterns"))
+        if (steps.back().starts_with("&failed to open patterns"))
             close(bound_datagram_socket(site.product + "/exec.patterns"));
         site.env.push_back("NOTIFY_SOCKET=/run/x");
         run_scenario({"-d", site.product}, steps, {.env = site.env});
