@@ -82,7 +82,7 @@ void open_output(bool terminal, int& ours, int& theirs) {
         close(fd);
     if (!how.directory.empty() && chdir(how.directory.c_str()) == -1)
         _exit(126);
-    std::vector<std::string> command = {torvad_binary};
+    std::vector<std::string> command = {how.program.empty() ? torvad_binary : how.program};
     if (under_wine)
         command.insert(command.begin(), "wine");
     if (!how.shell.empty())
@@ -138,10 +138,7 @@ const std::string torvad_binary = built(TORVAD_BINARY, "torvad.exe");
 const std::string child_binary = built(TEST_CHILD_BINARY, "tests/test_child");
 const std::string child_file =
     windows_build ? std::string(windows_build) + "/tests/test_child.exe" : TEST_CHILD_BINARY;
-const std::vector<std::string> tool_command =
-    windows_build ? std::vector<std::string>{"/usr/bin/wine",
-                                             std::string(windows_build) + "/torvad-patterns.exe"}
-                  : std::vector<std::string>{TORVAD_PATTERNS_BINARY};
+const std::string tool_binary = built(TORVAD_PATTERNS_BINARY, "torvad-patterns.exe");
 const std::string torvad_name = windows_build ? "torvad.exe" : "torvad";
 const int event_wait_ms = under_wine ? 30000 : 10000;
 

@@ -9,11 +9,9 @@
 namespace e2e {
 
 extern const bool under_wine;
-// torvad and the test child as torvad names them; the name its version
-// packet gives it; the test child's file and the command of torvad-patterns
-// as this system names them.
-extern const std::string torvad_binary, child_binary, torvad_name, child_file;
-extern const std::vector<std::string> tool_command;
+// torvad, the test child and torvad-patterns as torvad names them; the name
+// torvad's version packet gives it; the test child's file as this system names it.
+extern const std::string torvad_binary, child_binary, tool_binary, torvad_name, child_file;
 // The bound of a wait for an event; Wine moves every byte through its server.
 extern const int event_wait_ms;
 
@@ -25,6 +23,7 @@ struct options {
     std::vector<std::string> env;  // NAME=value set in the environment
     std::string directory;         // where it starts; empty: ours
     std::string shell;             // run first, as a careless parent leaves the start state
+    std::string program;           // run instead of torvad
     bool manager = false;          // a service manager of the test's own on NOTIFY_SOCKET
     systems where = systems::both; // where a row of run_rows holds
     bool as_root = false;          // a row of run_rows that holds only when we are root
