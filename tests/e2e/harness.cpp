@@ -15,6 +15,7 @@
 #include <optional>
 #include <poll.h>
 #include <pty.h>
+#include <regex>
 #include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -24,8 +25,6 @@
 #include <termios.h>
 #include <thread>
 #include <unistd.h>
-
-#include "tests/e2e/console_text.hpp"
 
 namespace e2e {
 
@@ -42,6 +41,25 @@ using clock = std::chrono::steady_clock;
 int remaining_ms(clock::time_point deadline) {
     auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - clock::now());
     return left.count() > 0 ? static_cast<int>(left.count()) : 0;
+}
+
+// Appends to text the whole lines that Wine's console drew in raw, as they
+// were written; gives how much of raw that took. A run of blanks is drawn as
+// an erase and a move over it, a trailing blank as an erase, the cursor is
+// hidden and shown around each change, and lines end in CR LF.
+std::size_t console_text(const std::string& raw, std::string& text) {
+    static const std::regex drawing("\x1b\\[\\?25[lh]|\x1b\\[K(?:\x1b\\[(\\d*)C|(?=\r))|\r(?=\n)");
+    std::size_t end = raw.rfind('\n') + 1; // 0 when no line is whole yet
+    auto from = raw.cbegin();
+    for (std::sregex_iterator at(from, from + end, drawing), none; at != none; ++at) {
+        const std::smatch& match = *at;
+        text.append(match.prefix().first, match.prefix().second);
+        if (match.str().starts_with("\x1b[K"))
+            text.append(match[1].matched && match[1].length() > 0 ? std::stoul(match[1]) : 1, ' ');
+        from = match.suffix().first;
+    }
+    text.append(from, raw.cbegin() + end);
+    return end;
 }
 
 // The output end: a pty, raw for torvad (no \r\n translation); under Wine

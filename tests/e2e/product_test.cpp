@@ -40,17 +40,12 @@ const char* const answers_version = "[ \"$1\" = -h ] && { echo 'core version 7' 
                                     "echo core runs as $(id -un)";
 const char* const core_ran = "?core runs as";
 
-class product : public ::testing::Test {
-    void SetUp() override {
-        if (!holds_here(systems::linux_only))
-            GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
-    }
-};
-
 } // namespace
 
 // The status text follows the state, naming the persistent children.
-TEST_F(product, service_path_reports_its_states_and_ends_children_in_order) {
+TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
+    if (!holds_here(systems::linux_only))
+        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
     const char* const running_0 = "@READY=1\nSTATUS=running, 0 children";
     const char* const running_1 = "@READY=1\nSTATUS=running, 1 child";
     const char* const stopping_0 = "@STOPPING=1\nSTATUS=stopping, waiting for 0 children";
@@ -85,7 +80,8 @@ TEST_F(product, service_path_reports_its_states_and_ends_children_in_order) {
         scratch_dir dir;
         args.insert(args.begin(), {"-p", dir.path + "/pid", "-d", dir.path});
         steps.push_back("@");
-        run_scenario(args, steps, {.terminal = false, .manager = true});
+        run_rows(
+            {{args, steps, {.terminal = false, .manager = true, .where = systems::linux_only}}});
         EXPECT_FALSE(file_exists(dir.path + "/pid"));
     }
 }
@@ -93,7 +89,9 @@ TEST_F(product, service_path_reports_its_states_and_ends_children_in_order) {
 // core runs under the account its init script names (the stub powershell's
 // output), and wins over wfe; wfe alone runs as the local service account and
 // runs no script.
-TEST_F(product, the_program_here_starts_with_its_account) {
+TEST(product, the_program_here_starts_with_its_account) {
+    if (!holds_here(systems::linux_only))
+        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
     struct row {
         const char* script; // the stub powershell's body; none when null
         std::vector<std::string> steps, programs = {"core"};
