@@ -20,7 +20,6 @@ cleanup() {
 tidy_cgroups() { [ -n "$cgroups" ] &&
     find /sys/fs/cgroup/*/libpod_parent -depth -type d -exec rmdir {} \; 2>/dev/null; }
 trap cleanup EXIT
-timed() { t=$(date +%s%N) && "$@" >/dev/null; took=$((($(date +%s%N) - t) / 1000000)); }
 logs_have() { p logs "$1" 2>&1 | grep -qF -- "$2"; }
 cores() { p top "$1" "${2:-pid}" comm | awk '$2 == "core" { print $1 }'; }
 one_core() { [ "$(cores "$1" | wc -l)" = 1 ]; }
@@ -75,9 +74,8 @@ check "no zombie is left after the burst" within 10 no_zombie_no_orphan
 old=$(cores demo)
 kill -9 "$(cores demo hpid)"
 check "kill -9 of core: one new core" within 10 one_new_core "$old"
-timed p stop -t 10 demo
+p stop -t 10 demo >/dev/null
 check "podman stop: core ends through sigterm, exit 0" ordered_stop demo
-check "podman stop: well within the grace period ($took ms)" test "$took" -lt 5000
 
 # A broken image ends, or goes on closed, and says why: never a silent hang.
 timeout 30 "$podman_sh" "$store" run --name empty --tmpfs /opt/torvad:notmpcopyup "$image" >/dev/null 2>&1
@@ -99,8 +97,8 @@ ctr=$(p ps --filter "pod=$pod" --format '{{.Names}}' | grep -v -- -infra)
 check "kube: core runs, relayed as before" within 10 logs_have "$ctr" "core: 'uname -sr' says: Linux"
 check "kube: torvad and core run as nobody" as_nobody "$ctr"
 check "kube: on a read-only root" test "$(p inspect -f '{{.HostConfig.ReadonlyRootfs}}' "$ctr")" = true
-timed p pod stop -t "$grace" "$pod"
-check "kube: core ends through sigterm, exit 0 ($took ms of ${grace} s)" ordered_stop "$ctr"
+p pod stop -t "$grace" "$pod" >/dev/null
+check "kube: core ends through sigterm, exit 0, within ${grace} s" ordered_stop "$ctr"
 check "kube down removes the pod" p kube down "$manifest"
 
 p rm -f -t 0 ready demo empty closed >/dev/null 2>&1 && p rmi -af >/dev/null 2>&1

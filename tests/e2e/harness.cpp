@@ -1,7 +1,6 @@
-// torvad runs in a session of its own, with its output on a pseudo-terminal
-// or a pipe, and its exit watched through a pidfd. Under Wine the terminal is
-// its console: Wine gives one to a program on a Unix terminal, draws on it and
-// turns a typed Ctrl-C into the console's event.
+// torvad runs in a session of its own, its output on a pseudo-terminal or a
+// pipe. Under Wine the terminal is its console: Wine draws on it and turns a
+// typed Ctrl-C into the console's event.
 #include "tests/e2e/harness.hpp"
 
 #include <gtest/gtest.h>
@@ -62,9 +61,8 @@ std::size_t console_text(const std::string& raw, std::string& text) {
     return end;
 }
 
-// The output end: a pty, raw for torvad (no \r\n translation); under Wine
-// wide enough that the console never wraps a line, and cooked, so that a
-// typed Ctrl-C is an interrupt. Or a pipe.
+// The output end: a pipe, or a pty, raw (no \r\n); under Wine cooked, so that
+// Ctrl-C is an interrupt, and wide enough that the console never wraps a line.
 void open_output(bool terminal, int& ours, int& theirs) {
     winsize size{100, 8192, 0, 0};
     int ends[2];
@@ -83,8 +81,8 @@ void open_output(bool terminal, int& ours, int& theirs) {
     fcntl(ours, F_SETFD, FD_CLOEXEC);
 }
 
-// In a session of its own, so that a signal to its group reaches only it and
-// what it starts; under Wine the terminal is its console, so also its stdin.
+// A signal to its session's group reaches only it and what it starts. Under
+// Wine the terminal is its console, so also its stdin.
 [[noreturn]] void exec_daemon(const std::vector<std::string>& args, const options& how, int out) {
     setsid();
     unsetenv("NOTIFY_SOCKET");

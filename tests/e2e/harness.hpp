@@ -9,8 +9,8 @@
 namespace e2e {
 
 extern const bool under_wine;
-// torvad, the test child and torvad-patterns as torvad names them; the name
-// torvad's version packet gives it; the test child's file as this system names it.
+// The programs as torvad names them; the name torvad's version packet gives
+// it; the test child's file as this system names it.
 extern const std::string torvad_binary, child_binary, tool_binary, torvad_name, child_file;
 // The bound of a wait for an event; Wine moves every byte through its server.
 extern const int event_wait_ms;
@@ -36,8 +36,7 @@ inline const options on_linux{.where = systems::linux_only},
 //   "?text" waits for text behind the last match    "!INT" / "!TERM" signals torvad
 //   "#key"  takes the pid behind "key=" as the child "kill N" sends signal N to it
 //   "=N"    expects exit code N                     "-text" text never appears
-//   "&text" waits for text anywhere
-//   "z"     within the bound, no child of torvad is a zombie
+//   "&text" waits for text anywhere                 "z" no child of torvad is a zombie
 //   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
 //   "Ppath" the file at path holds torvad's pid and a line feed
 // With a manager: "@message" expects its next report, "@*" drops those still

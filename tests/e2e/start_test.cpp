@@ -1,5 +1,4 @@
-// The program's start and end as an operator sees them: help, PID file,
-// working directory, console and service paths.
+// The program's start and end as an operator sees them.
 #include <gtest/gtest.h>
 
 #include "tests/e2e/harness.hpp"
@@ -23,9 +22,9 @@ TEST(start, options_help_and_the_pid_file) {
         {{}, {ok, "=0", no_pid_file}},
         {{"-d"}, {ok, "=0", no_pid_file}},
         {{"-a", "garbage", "-d", "/no/such/dir", "stray", "-zz", "-"}, {ok, "=0", no_pid_file}},
-        // -l: each line is also a record of the event log, which Wine writes to
-        // its debug channel: the source registered once; the level's type,
-        // category 0, event 0, no user, two strings, no data. Without -l, none.
+        // -l: each line is also an event log record (Wine traces them): the source
+        // registered once; the level's type, category 0, event 0, no user, two
+        // strings, no data. Without -l, none.
         {{"-l", "-p", dir.path + "/missing/pid"},
          {"?failed to create pid file", ok, "=0", "&RegisterEventSourceA ((null),\"torvad\")",
           "&,0x0001" + record, "&err:eventlog:ReportEventW L\"torvad\"\n",

@@ -17,22 +17,6 @@ using namespace e2e;
 
 namespace {
 
-// A product directory ("my product", a blank in its path) with the test child
-// as core.exe, and the given tool stand-ins in a folder in front of PATH.
-struct installation {
-    explicit installation(std::vector<std::string> tools) {
-        std::filesystem::create_directories(product);
-        std::filesystem::create_directories(bin);
-        tools.push_back("../my product/core.exe");
-        for (const auto& tool : tools)
-            std::filesystem::copy(child_file, root.path + "/bin/" + tool);
-    }
-    std::string log(const std::string& name) const { return read_file(product + "/" + name); }
-    scratch_dir root;
-    std::string product = root.path + "/my product", bin = root.path + "/bin";
-    std::vector<std::string> env = {"WINEPATH=" + windows_form(root.path + "/bin")};
-};
-
 // Runs a program of Wine's to its end; its output, both streams. Through a
 // file: a program of Wine's own session that it starts holds a pipe open.
 std::string run_wine(const std::vector<std::string>& args, int* exit_code = nullptr) {
@@ -60,17 +44,22 @@ bool becomes_true(const std::function<bool()>& condition) {
 TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
     if (!under_wine)
         GTEST_SKIP() << "the Windows build under Wine";
-    installation site({"schtasks.exe", "powershell.exe"});
-    std::ofstream(site.product + "/silent");
-    std::string pid_file = site.root.path + "/pid";
-    run_scenario({"-f", "acme", "-p", pid_file, "-d", site.product},
-                 {"=1", "-successfully started"}, {.terminal = false, .env = site.env});
+    // A product directory with a blank in its path; the stand-ins in front of PATH.
+    scratch_dir root;
+    std::string product = root.path + "/my product", pid_file = root.path + "/pid";
+    std::filesystem::create_directories(root.path + "/bin");
+    std::filesystem::create_directories(product);
+    std::ofstream(product + "/silent");
+    for (const char* tool : {"/bin/schtasks.exe", "/bin/powershell.exe", "/my product/core.exe"})
+        std::filesystem::copy(child_file, root.path + tool);
+    run_scenario({"-f", "acme", "-p", pid_file, "-d", product}, {"=1", "-successfully started"},
+                 {.terminal = false, .env = {"WINEPATH=" + windows_form(root.path + "/bin")}});
     EXPECT_TRUE(file_exists(pid_file));
-    EXPECT_EQ(site.log("powershell.log"), "");
-    EXPECT_EQ(site.log("schtasks.log"),
+    EXPECT_EQ(read_file(product + "/powershell.log"), "");
+    EXPECT_EQ(read_file(product + "/schtasks.log"),
               R"(/create /f /tn startts /sc onstart /ru system /tr "powershell -command )"
               R"(""start-sleep -s 10; sc.exe config acmeServer binpath= \\"")" +
-                  windows_form(site.product) +
+                  windows_form(product) +
                   R"(\core.exe\\""; sc.exe start torvaSentryServer; schtasks.exe /delete /f )"
                   "/tn startts\"\"\"\n/run /tn startts\n");
 }

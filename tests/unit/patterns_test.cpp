@@ -65,8 +65,7 @@ TEST(patterns, lines_permit_exactly_what_they_say) {
     EXPECT_EQ(decided(closed, "svc", {"anything"}), denied);
 }
 
-// The other refusals, with their statuses, run end to end in the hostile and
-// product tests; these two show only here.
+// Two refusals that show only here; the others run end to end.
 TEST(patterns, execute_requests_take_user_and_path_items_first) {
     std::vector<skipped_line> skipped;
     const pattern_lists lists = parse_patterns("(all) /usr/bin/id\n", skipped);

@@ -195,8 +195,8 @@ TEST(process, the_owner_hears_each_end_and_restarts_in_place) {
     unlink(marker.c_str());
 }
 
-// A child the terminal stopped (it read the terminal from its background
-// group) can't take its sigterm: a stop continues it, and names the stop.
+// A child the terminal stopped (it read from its background group) can't take
+// its sigterm: a stop continues it, and names the stop.
 TEST(process, a_stop_continues_a_child_the_terminal_stopped) {
     rig peer;
     peer.execute(1, execute_persistent, "kill -TTIN $$; exit 7");
@@ -266,9 +266,8 @@ TEST(process, packets_are_framed_across_reads_and_traced) {
     }
 }
 
-// What a child's end counts as decides its restart and the code its requester
-// sees: its status, or 128 + its signal unless we ended it; a status that
-// can't be read is a clean end, no restart.
+// An end counts as its status, or 128 + its signal unless we ended it; a status
+// that can't be read is a clean end, no restart.
 TEST(process, an_end_counts_as_its_status_or_its_signal) {
     const platform::os_error unreadable{10, "waitid"};
     const std::tuple<platform::exit_status, bool, std::uint32_t> rows[] = {
