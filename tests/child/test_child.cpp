@@ -5,6 +5,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <fcntl.h>
 #include <filesystem>
 #include <fstream>
 #include <string>
@@ -29,10 +30,12 @@ using namespace torvad;
 using peer::connection;
 namespace fs = std::filesystem;
 
+int out_fd = 1; // stdout, or core.log for a core with no console (a service's)
+
 // One write for the line, so it stands whole beside the supervisor's.
 void say(std::string line) {
     line = "child: " + line + "\n";
-    if (write(1, line.data(), static_cast<unsigned>(line.size())) < 0) {
+    if (write(out_fd, line.data(), static_cast<unsigned>(line.size())) < 0) {
     }
 }
 
@@ -84,20 +87,6 @@ int mode_fds(const context& how) {
     if (std::getenv("NOTIFY_SOCKET") != nullptr)
         say("notify socket inherited");
     return serve(how);
-}
-
-// A peer reporting its version, then its sigterm, to file: a service has no console.
-int record(const std::string& file, int ipc_fd) {
-    std::ofstream report(file, std::ios::app | std::ios::binary);
-    connection link(ipc_fd);
-    peer::version_info version;
-    if (!peer::read_version(link, version))
-        return 5;
-    report << "version " << version.version << " Background:" << version.background << std::endl;
-    for (peer::packet packet; link.receive(packet);)
-        if (packet.header.type == packet_sigterm)
-            return report << "sigterm" << std::endl ? 0 : 1;
-    return 4;
 }
 
 // Sends one execute per request, "FLAGS ITEMS...", "+" between requests, on
@@ -154,14 +143,14 @@ int main(int argc, char** argv) {
         return code;
     context how{{}, peer::ipc_fd_from_arguments(argc, argv)};
     // Named core, it is the product's server program: -h gives its version on
-    // stderr (unless a file "silent" is there); it records to "core.log" when
-    // that is there (no console), or else reports as the fds mode does.
+    // stderr (unless a file "silent" is there); else it reports as the fds mode
+    // does, to "core.log" when that is there.
     bool core = fs::path(argv[0]).stem() == "core";
     if (core && argc > 1 && std::string_view(argv[1]) == "-h")
         return std::fputs(fs::exists("silent") ? "usage: core\n" : "test_child version 1\n",
                           stderr) < 0;
     if (core && fs::exists("core.log"))
-        return record("core.log", how.ipc_fd);
+        out_fd = open("core.log", O_WRONLY | O_APPEND);
     if (core)
         return mode_fds(how);
     if (argc > 1)

@@ -65,7 +65,7 @@ TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
 }
 
 // Created, started, queried and stopped with sc.exe, as an installation runs
-// torvad on the product in its working directory: core.exe records to
+// torvad on the product in its working directory: core.exe reports to
 // core.log, with no console to write to, its version first and its sigterm last.
 TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     if (!under_wine)
@@ -89,12 +89,13 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     };
     run_wine({"sc", "start", name});
     EXPECT_TRUE(becomes_true(state_is("RUNNING")));
-    EXPECT_TRUE(becomes_true([&] { return read_file(record).starts_with("version 1.1.21.0"); }))
-        << read_file(record);
+    EXPECT_TRUE(becomes_true([&] {
+        return read_file(record).starts_with("child: version torvad.exe 1.1.21.0 Background:true");
+    })) << read_file(record);
     EXPECT_TRUE(file_exists(pid));
     run_wine({"sc", "stop", name});
     EXPECT_TRUE(becomes_true(state_is("STOPPED")));
-    EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("sigterm\n"); }))
+    EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("child: sigterm\r\n"); }))
         << read_file(record);
     EXPECT_TRUE(becomes_true([&] { return !file_exists(pid); }));
     run_wine({"sc", "delete", name});
