@@ -19,7 +19,7 @@ TEST(children, launch_exit_restart_and_stop) {
     const options root{.where = systems::linux_only, .as_root = true};
     const std::string copy = anyone.path + "/test_child"; // its rows hold on Linux alone
     std::filesystem::copy(child_file, copy);
-    std::vector<row> rows = {
+    run_rows({
         // version comes first; a stop is a sigterm packet, and 0 ends the run.
         // Ctrl-C reaches the terminal's whole group: the child ends by sigterm,
         // not by it. -v traces packets, coloured at a terminal.
@@ -65,21 +65,14 @@ TEST(children, launch_exit_restart_and_stop) {
         {child({"fds"}, {"-u", "OTHERDOMAIN\\nobody"}),
          {"?Failed to logon as user 'OTHERDOMAIN\\nobody': error 2", "=0", "-child: "},
          root},
-    };
-    // Two orphans end the moment their supervised ancestor exits with 3: they
-    // come to us, at a console and as a service alike, and are reaped; the
-    // supervised exit is still read as 3, so the child restarts.
-    for (const auto& [marker, how] :
-         {std::pair{"/orphaned", on_linux},
-          {"/orphaned-too",
-           options{.terminal = false, .manager = true, .where = systems::linux_only}}})
-        rows.push_back(
-            {child({"orphans", "2", dir.path + marker}),
-             {"?child: orphans made", "?'test_child' exited with 0x3.",
-              "?starting 'test_child' again.", "?child: ready",
-              "&child: orphan adopted by torvad\n", "z", "!TERM", "?child: sigterm", "=0"},
-             how});
-    run_rows(rows);
+        // two orphans end the moment their supervised ancestor exits with 3:
+        // they come to us and are reaped, and the exit is still read as 3
+        {child({"orphans", "2", dir.path + "/orphaned"}),
+         {"?child: orphans made", "?'test_child' exited with 0x3.", "?starting 'test_child' again.",
+          "?child: ready", "&child: orphan adopted by torvad\n", "z", "!TERM", "?child: sigterm",
+          "=0"},
+         on_linux},
+    });
 }
 
 // When a requester ends, its channels lose their pipes and run on: a cat
