@@ -118,14 +118,12 @@ struct daemon_run {
     ~daemon_run();
     daemon_run(const daemon_run&) = delete;
 
-    // Reads until text appears behind the cursor, or anywhere (the cursor kept).
-    bool wait_for(const std::string& text, int timeout_ms = event_wait_ms);
-    bool wait_anywhere(const std::string& text);
+    // Reads until text appears behind the cursor (from, when given).
+    bool wait_for(const std::string& text, std::size_t from = std::string::npos);
     // The exit code, or -1 when it didn't end in time (it is killed then).
     int wait_exit(int timeout_ms = event_wait_ms);
-    // A stop request; Ctrl-C to its terminal's whole group.
-    void signal(int signal_number);
-    void interrupt_group();
+    // A stop request, to torvad or to its terminal's whole group.
+    void signal(int signal_number, bool group = false);
     bool read_some(int timeout_ms); // false when nothing came in time
 
     int pid_ = -1, out_fd_ = -1, exit_code_ = -1;
@@ -219,18 +217,11 @@ int daemon_run::wait_exit(int timeout_ms) {
 }
 
 // A console under Wine has one stop request, Ctrl-C, whatever was asked for.
-void daemon_run::signal(int signal_number) {
-    if (under_wine)
-        interrupt_group();
-    else
-        kill(pid_, signal_number);
-}
-
-void daemon_run::interrupt_group() {
+void daemon_run::signal(int signal_number, bool group) {
     if (under_wine)
         (void)!write(out_fd_, "\x03", 1);
     else
-        kill(-pid_, SIGINT);
+        kill(group ? -pid_ : pid_, signal_number);
 }
 
 // Windows programs see the Linux root as drive Z:.
@@ -239,21 +230,15 @@ std::string windows_form(std::string path) {
     return "Z:" + path;
 }
 
-bool daemon_run::wait_for(const std::string& text, int timeout_ms) {
-    auto deadline = clock::now() + std::chrono::milliseconds(timeout_ms);
+bool daemon_run::wait_for(const std::string& text, std::size_t from) {
+    auto deadline = clock::now() + std::chrono::milliseconds(event_wait_ms);
     std::size_t found;
-    while ((found = output_.find(text, cursor_)) == std::string::npos)
+    while ((found = output_.find(text, std::min(from, cursor_))) == std::string::npos)
         if (!read_some(remaining_ms(deadline)) && (eof_ || remaining_ms(deadline) == 0))
             return false;
-    cursor_ = found + text.size();
+    if (from == std::string::npos)
+        cursor_ = found + text.size();
     return true;
-}
-
-bool daemon_run::wait_anywhere(const std::string& text) {
-    std::size_t kept = std::exchange(cursor_, 0);
-    bool found = wait_for(text);
-    cursor_ = kept;
-    return found;
 }
 
 namespace {
@@ -290,7 +275,7 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
         if (step[0] == '?')
             EXPECT_TRUE(run.wait_for(text)) << "waited for: " << text << "\n" << out;
         else if (step == "!GROUP")
-            run.interrupt_group();
+            run.signal(SIGINT, true);
         else if (step == "!USR2")
             kill(run.pid_, SIGUSR2);
         else if (step[0] == '!')
@@ -313,7 +298,7 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
         else if (step == "z")
             EXPECT_TRUE(no_zombie_within(run.pid_, event_wait_ms)) << out;
         else if (step[0] == '&')
-            EXPECT_TRUE(run.wait_anywhere(text)) << "waited for: " << text << "\n" << out;
+            EXPECT_TRUE(run.wait_for(text, 0)) << "waited for: " << text << "\n" << out;
         else if (step[0] == '-')
             EXPECT_EQ(out.find(text), std::string::npos) << text << "\n" << out;
         else
