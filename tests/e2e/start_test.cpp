@@ -1,4 +1,6 @@
-// The program's start and end as an operator sees them.
+// The programs' start and end as an operator sees them: torvad's, and
+// torvad-patterns', whose report and exit status tell its decision (its words
+// are unit tested).
 #include <gtest/gtest.h>
 
 #include "tests/e2e/harness.hpp"
@@ -52,4 +54,19 @@ TEST(start, options_help_and_the_pid_file) {
     });
     EXPECT_FALSE(file_exists(pid) || file_exists(dir.path + "/torvad.pid") ||
                  file_exists(elsewhere.path + "/torvad.pid"));
+}
+
+TEST(start, torvad_patterns_prints_its_report_and_ends_with_its_status) {
+    const options tool{.terminal = false, .program = tool_binary};
+    run_rows({
+        {{"explain", DEMO_PATTERNS, "--", "uname", "-a"}, {"?permitted by line 4", "=0"}, tool},
+        {{"explain", DEMO_PATTERNS, "--", "uname", "-a", "-r"},
+         {"?line 6 (no match)", "=13"},
+         tool},
+        {{"explain", "/no/such/file", "--", "uname"},
+         {"?failed to open patterns file", "=2"},
+         tool},
+        {{"check", DEMO_PATTERNS}, {"?0 lines skipped", "=0"}, tool},
+        {{"explain", DEMO_PATTERNS}, {"?usage: torvad-patterns", "=64"}, tool},
+    });
 }

@@ -82,19 +82,17 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     int created = 1;
     std::string said = run_wine({"sc", "create", name, "binpath=", command}, &created);
     ASSERT_EQ(created, 0) << said;
-    auto state_is = [&name](const char* state) {
-        return [&name, state] {
-            return run_wine({"sc", "query", name}).find(state) != std::string::npos;
-        };
+    auto in_state = [&name](const char* state) {
+        return run_wine({"sc", "query", name}).find(state) != std::string::npos;
     };
     run_wine({"sc", "start", name});
-    EXPECT_TRUE(becomes_true(state_is("RUNNING")));
+    EXPECT_TRUE(becomes_true([&] { return in_state("RUNNING"); }));
     EXPECT_TRUE(becomes_true([&] {
         return read_file(record).starts_with("child: version torvad.exe 1.1.21.0 Background:true");
     })) << read_file(record);
     EXPECT_TRUE(file_exists(pid));
     run_wine({"sc", "stop", name});
-    EXPECT_TRUE(becomes_true(state_is("STOPPED")));
+    EXPECT_TRUE(becomes_true([&] { return in_state("STOPPED"); }));
     EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("child: sigterm\r\n"); }))
         << read_file(record);
     EXPECT_TRUE(becomes_true([&] { return !file_exists(pid); }));
