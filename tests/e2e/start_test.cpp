@@ -18,6 +18,7 @@ TEST(start, options_help_and_the_pid_file) {
     scratch_dir dir, elsewhere;
     const std::string pid = dir.path + "/pid", ok = std::string("?") + started;
     const char* const no_pid_file = "-failed to create pid file";
+    const options pipe{.terminal = false};
     const char* const debug = "WINEDEBUG=fixme+advapi,+eventlog";
     const std::string record = ",0x0000,0x00000000,0000000000000000,0x0002,0x00000000,";
     run_rows({
@@ -46,10 +47,8 @@ TEST(start, options_help_and_the_pid_file) {
         {{"-p", pid, "-v", "-h", "-p"},
          {"?torvad version 1.1.21.0\nUsage: " + torvad_binary + " <options> -- <exe> <exe args>\n",
           "?  -a  <pid> <pipe>\n", "=0", "-successfully"},
-         {.terminal = false}},
-        {{"-v", "-l", "--", child_binary, "exit", "0"},
-         {"=0", "-torvad", "-child"},
-         {.terminal = false}},
+         pipe},
+        {{"-v", "-l", "--", child_binary, "exit", "0"}, {"=0", "-torvad", "-child"}, pipe},
         {{"-b", "--", child_binary, "exit", "0"}, {"=0", "-torvad", "-child"}},
     });
     EXPECT_FALSE(file_exists(pid) || file_exists(dir.path + "/torvad.pid") ||
@@ -58,15 +57,12 @@ TEST(start, options_help_and_the_pid_file) {
 
 TEST(start, torvad_patterns_prints_its_report_and_ends_with_its_status) {
     const options tool{.terminal = false, .program = tool_binary};
+    const std::string demo = DEMO_PATTERNS;
     run_rows({
-        {{"explain", DEMO_PATTERNS, "--", "uname", "-a"}, {"?permitted by line 4", "=0"}, tool},
-        {{"explain", DEMO_PATTERNS, "--", "uname", "-a", "-r"},
-         {"?line 6 (no match)", "=13"},
-         tool},
-        {{"explain", "/no/such/file", "--", "uname"},
-         {"?failed to open patterns file", "=2"},
-         tool},
-        {{"check", DEMO_PATTERNS}, {"?0 lines skipped", "=0"}, tool},
-        {{"explain", DEMO_PATTERNS}, {"?usage: torvad-patterns", "=64"}, tool},
+        {{"explain", demo, "--", "uname", "-a"}, {"?permitted by line 4", "=0"}, tool},
+        {{"explain", demo, "--", "uname", "-a", "-r"}, {"?line 6 (no match)", "=13"}, tool},
+        {{"explain", "/no/such", "--", "uname"}, {"?failed to open patterns file", "=2"}, tool},
+        {{"check", demo}, {"?0 lines skipped", "=0"}, tool},
+        {{"explain", demo}, {"?usage: torvad-patterns", "=64"}, tool},
     });
 }
