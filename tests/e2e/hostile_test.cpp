@@ -18,6 +18,8 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
     // Wine hands our UTF-8 to the requester in its ANSI code page; whatever
     // bytes it sends must arrive.
     const std::string utf8 = under_wine ? "\\xe9\\x80" : "\\xc3\\xa9\\xe2\\x82\\xac";
+    const std::vector<std::string> ordered_stop = {
+        "?stopping torvad", "?child: sigterm", "?'test_child' exited with 0x0.", "=0", "-again"};
     run_rows({
         // refusals carry their statuses: malformed, not permitted, not found
         {child({"execute", "8", "only", "+", "0", "", "+", "8", "someone_else", "/bin/true", "+",
@@ -52,12 +54,8 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
           "?'test_child' exited with 0x0.", "=0"},
          {.shell = "trap '' CHLD", .where = systems::linux_only}},
         // Ctrl-Break and the console's close stop the children the same way
-        {{"--", child_binary, "console-event", "1"},
-         {"?stopping torvad", "?child: sigterm", "?'test_child' exited with 0x0.", "=0", "-again"},
-         on_windows},
-        {{"--", child_binary, "console-event", "2"},
-         {"?stopping torvad", "?child: sigterm", "?'test_child' exited with 0x0.", "=0"},
-         on_windows},
+        {child({"console-event", "1"}), ordered_stop, on_windows},
+        {child({"console-event", "2"}), ordered_stop, on_windows},
         // each item reaches the program whole: none of it can become an argument of its own
         {child({"execute", pipes, child_binary, "args", "a\\\" --delete-all", "C:\\dir\\", "x y",
                 "\\\\\"q\\", "", "t\tab", "\"", "\\", "\xc3\xa9\xe2\x82\xac", "end"}),
