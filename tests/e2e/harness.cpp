@@ -332,11 +332,6 @@ std::vector<std::string> child(std::vector<std::string> mode, std::vector<std::s
     return options;
 }
 
-bool file_exists(const std::string& path) {
-    std::error_code ignored;
-    return std::filesystem::exists(path, ignored);
-}
-
 std::string read_file(const std::string& path) {
     std::ifstream file(path, std::ios::binary);
     return {std::istreambuf_iterator<char>(file), {}};

@@ -64,7 +64,6 @@ std::vector<std::string> child(std::vector<std::string> mode,
                                std::vector<std::string> options = {});
 // A path here as Windows programs under Wine see it.
 std::string windows_form(std::string path);
-bool file_exists(const std::string& path);
 std::string read_file(const std::string& path);
 // A datagram socket bound at path, as a service manager or a log daemon has.
 int bound_datagram_socket(const std::string& path);

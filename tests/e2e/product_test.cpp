@@ -79,7 +79,7 @@ TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
         steps.push_back("@");
         run_rows(
             {{args, steps, {.terminal = false, .manager = true, .where = systems::linux_only}}});
-        EXPECT_FALSE(file_exists(dir.path + "/pid"));
+        EXPECT_FALSE(std::filesystem::exists(dir.path + "/pid"));
     }
 }
 

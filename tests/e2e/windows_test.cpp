@@ -54,7 +54,7 @@ TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
         std::filesystem::copy(child_file, root.path + tool);
     run_scenario({"-f", "acme", "-p", pid_file, "-d", product}, {"=1", "-successfully started"},
                  {.terminal = false, .env = {"WINEPATH=" + windows_form(root.path + "/bin")}});
-    EXPECT_TRUE(file_exists(pid_file));
+    EXPECT_TRUE(std::filesystem::exists(pid_file));
     EXPECT_EQ(read_file(product + "/powershell.log"), "");
     EXPECT_EQ(read_file(product + "/schtasks.log"),
               R"(/create /f /tn startts /sc onstart /ru system /tr "powershell -command )"
@@ -90,11 +90,11 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     EXPECT_TRUE(becomes_true([&] {
         return read_file(record).starts_with("child: version torvad.exe 1.1.21.0 Background:true");
     })) << read_file(record);
-    EXPECT_TRUE(file_exists(pid));
+    EXPECT_TRUE(std::filesystem::exists(pid));
     run_wine({"sc", "stop", name});
     EXPECT_TRUE(becomes_true([&] { return in_state("STOPPED"); }));
     EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("child: sigterm\r\n"); }))
         << read_file(record);
-    EXPECT_TRUE(becomes_true([&] { return !file_exists(pid); }));
+    EXPECT_TRUE(becomes_true([&] { return !std::filesystem::exists(pid); }));
     run_wine({"sc", "delete", name});
 }
