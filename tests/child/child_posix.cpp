@@ -76,10 +76,9 @@ bool start_attached(const std::string& torvad, int& ours, long& theirs) {
     ours = ends[0];
     theirs = ends[1];
     std::string pid = std::to_string(getpid()), fd = std::to_string(theirs);
-    if (fork() == 0)
-        execl(torvad.c_str(), torvad.c_str(), "-v", "-a", pid.c_str(), fd.c_str(), "--",
-              "never_run", nullptr),
-            _exit(127);
+    if (fork() == 0 && execl(torvad.c_str(), torvad.c_str(), "-v", "-a", pid.c_str(), fd.c_str(),
+                             "--", "never_run", nullptr) == -1)
+        _exit(127);
     return close(ends[1]) == 0;
 }
 
