@@ -34,9 +34,9 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
         // a working directory deleted under us (Windows keeps one that is in use):
         // only a relative name is not found; a grandchild holding a channel's
         // pipe does not hold back the channel's end (past the wait)
-        {{"-d",     doomed.path, "--", child_binary,        "execute", "!rmcwd", "+",    "0",
-          "./prog", "+",         "0",  "/bin/true",         "+",       "0",      "true", "+",
-          pipes,    "/bin/sh",   "-c", "sleep 12 & echo hi"},
+        {child({"execute", "!rmcwd", "+", "0", "./prog", "+", "0", "/bin/true", "+", "0", "true",
+                "+", pipes, "/bin/sh", "-c", "sleep 12 & echo hi"},
+               {"-d", doomed.path}),
          {"?child: rmcwd 0", "&executable './prog' not found.", "?child: 1 failed 2",
           "&child: 2 closed 0", "&child: 3 closed 0", "&child: 4 stdout hi", "&child: 4 closed 0",
           "!INT", "=0"},
