@@ -12,8 +12,6 @@ extern const bool under_wine;
 // The programs as torvad names them; the name torvad's version packet gives
 // it; the test child's file as this system names it.
 extern const std::string torvad_binary, child_binary, tool_binary, torvad_name, child_file;
-// The bound of a wait for an event; Wine moves every byte through its server.
-extern const int event_wait_ms;
 
 enum class systems { both, linux_only, windows_only };
 bool holds_here(systems where);
