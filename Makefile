@@ -1,13 +1,24 @@
 # The two commands of the README, and the steps they are made of.
-PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
-            libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-14-dev \
+# The packages are those of the Debian release that runs make: Debian 12 ships
+# Boost 1.81 beside its default 1.74, Debian 13 has 1.83 as its default; the
+# fuzzers link the runtime of the release's clang.
+RELEASE := $(shell . /etc/os-release && echo $$VERSION_CODENAME)
+BOOST_bookworm := 1.81
+BOOST_trixie := 1.83
+CLANG_bookworm := 14
+CLANG_trixie := 19
+BOOST := $(BOOST_$(RELEASE))
+CLANG := $(CLANG_$(RELEASE))
+$(if $(BOOST),,$(error torvad builds on Debian 12 (bookworm) or 13 (trixie), not on '$(RELEASE)'))
+PACKAGES := libboost$(BOOST)-dev libboost-filesystem$(BOOST)-dev libgtest-dev \
+            libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-$(CLANG)-dev \
             clang-format
 FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
 VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
 
 .PHONY: all deps build run package test test-asan test-system fuzz bench format format-check clean \
-        windows windows-deps test-windows container-deps image test-container
+        windows windows-deps wine-deps test-windows container-deps image test-container test-debian13
 
 all: build
 
@@ -77,6 +88,15 @@ image: build container-deps
 test-container: image
 	tests/container/run.sh build/torvad-image.tar deploy/kubernetes/torvad.yaml
 
+# --- Debian 13: the README's commands on the other release ---------------------
+# In a Debian 13 root made with debootstrap and kept in build-debian13: make
+# build, the plain tests, make run until core's restart, and make windows.
+# Needs root; leaves no mount and no process behind.
+test-debian13:
+	@command -v debootstrap >/dev/null || { apt-get update && \
+	  DEBIAN_FRONTEND=noninteractive apt-get install -y debootstrap; }
+	.ci/debian13 build-debian13
+
 build-asan/build.ninja:
 	cmake -S . -B build-asan -G Ninja -DCMAKE_BUILD_TYPE=Debug -DTORVAD_SANITIZE=ON
 
@@ -122,11 +142,12 @@ format-check: deps
 	clang-format --dry-run -Werror $$(git ls-files '*.cpp' '*.hpp')
 
 clean:
-	rm -rf build build-asan build-fuzz $(WIN)
+	rm -rf build build-asan build-fuzz $(WIN) build-debian13
 
 # --- Windows: cross-built with mingw-w64, its tests run under Wine ------------
-WINDOWS_PACKAGES := g++-mingw-w64-x86-64-posix wine wine64 libboost1.81-dev googletest \
-                    cmake ninja-build xz-utils
+WINDOWS_PACKAGES := g++-mingw-w64-x86-64-posix libboost$(BOOST)-dev googletest cmake ninja-build \
+                    xz-utils
+WINE_PACKAGES := wine wine64
 WIN := build-windows
 # Boost's headers through a folder that holds only boost/, and the source of
 # Boost.Filesystem's compiled part, which Debian builds for Linux only.
@@ -141,13 +162,17 @@ windows-deps:
 	@dpkg -s $(WINDOWS_PACKAGES) >/dev/null 2>&1 || { \
 	  apt-get update && DEBIAN_FRONTEND=noninteractive apt-get install -y $(WINDOWS_PACKAGES); }
 
+wine-deps:
+	@dpkg -s $(WINE_PACKAGES) >/dev/null 2>&1 || { \
+	  apt-get update && DEBIAN_FRONTEND=noninteractive apt-get install -y $(WINE_PACKAGES); }
+
 $(WIN_BOOST)/filesystem/src/operations.cpp:
 	mkdir -p $(WIN_APT)/sources.list.d $(WIN_APT)/lists/partial $(WIN_APT)/cache/archives/partial \
 	  $(WIN_BOOST)/source $(WIN_BOOST)/include $(WIN_BOOST)/filesystem
-	cp cmake/boost-source.list $(WIN_APT)/sources.list.d/
+	sed 's/@RELEASE@/$(RELEASE)/' cmake/boost-source.list >$(WIN_APT)/sources.list.d/boost-source.list
 	apt-get $(WIN_APT_OPTIONS) update
-	cd $(WIN_BOOST)/source && apt-get $(WIN_APT_OPTIONS) source --download-only boost1.81
-	tar -xJf $(WIN_BOOST)/source/boost1.81_1.81.0.orig.tar.xz -C $(WIN_BOOST)/filesystem \
+	cd $(WIN_BOOST)/source && apt-get $(WIN_APT_OPTIONS) source --download-only boost$(BOOST)
+	tar -xJf $(WIN_BOOST)/source/boost$(BOOST)_$(BOOST).0.orig.tar.xz -C $(WIN_BOOST)/filesystem \
 	  --strip-components=3 --wildcards '*/libs/filesystem/src/*'
 	ln -sfn /usr/include/boost $(WIN_BOOST)/include/boost
 
@@ -164,7 +189,7 @@ windows: windows-deps $(WIN)/build.ninja
 # test they would hold that test's output open for as long as they run.
 # The unit tests are the Windows build's own; the end-to-end tests are this
 # system's, driving the Windows build's programs.
-test-windows: windows build
+test-windows: windows build wine-deps
 	test -f $(WIN)/wine/system.reg || $(WINE_ENV) wineboot --init </dev/null >/dev/null 2>&1
 	$(WINE_ENV) wineserver --kill 2>/dev/null; $(WINE_ENV) wineserver --persistent </dev/null >/dev/null 2>&1
 	$(WINE_ENV) wine cmd /c exit </dev/null >/dev/null 2>&1

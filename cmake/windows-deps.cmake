@@ -1,8 +1,8 @@
 # What Debian doesn't ship built for mingw, built here once and kept in the
-# build folder: Boost.Filesystem's compiled part from Debian's boost1.81
-# source, and GoogleTest from /usr/src/googletest. Boost's headers are Debian's
-# own 1.81 ones, seen through TORVAD_BOOST_WINDOWS/include, which holds only
-# boost/.
+# build folder: Boost.Filesystem's compiled part from the source package of
+# the release's Boost (boost1.81 on Debian 12, boost1.83 on 13), and GoogleTest
+# from /usr/src/googletest. Boost's headers are that release's own, seen
+# through TORVAD_BOOST_WINDOWS/include, which holds only boost/.
 set(TORVAD_BOOST_WINDOWS "" CACHE PATH
     "Folder with include/boost and Boost.Filesystem's src/ (make windows fills it)")
 if(NOT EXISTS "${TORVAD_BOOST_WINDOWS}/include/boost/version.hpp"

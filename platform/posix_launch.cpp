@@ -49,7 +49,7 @@ struct child_plan {
 // Default dispositions before the mask opens, so no handler of ours can
 // ever run in the child.
 void reset_signals() {
-    struct sigaction default_action {};
+    struct sigaction default_action = {};
     default_action.sa_handler = SIG_DFL;
     for (int signal_number = 1; signal_number < NSIG; ++signal_number)
         sigaction(signal_number, &default_action, nullptr);

@@ -24,7 +24,7 @@ std::vector<std::string> start_state(int ipc_fd) {
     sigprocmask(SIG_SETMASK, nullptr, &mask);
     bool blocked = false;
     for (int number = 1; number < NSIG; ++number) {
-        struct sigaction action {};
+        struct sigaction action = {};
         blocked = blocked || sigismember(&mask, number) == 1;
         if (sigaction(number, nullptr, &action) == 0 && action.sa_handler == SIG_IGN)
             ignored += " " + std::to_string(number);
