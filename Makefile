@@ -11,13 +11,14 @@ BOOST := $(BOOST_$(RELEASE))
 CLANG := $(CLANG_$(RELEASE))
 $(if $(BOOST),,$(error torvad builds on Debian 12 (bookworm) or 13 (trixie), not on '$(RELEASE)'))
 PACKAGES := libboost$(BOOST)-dev libboost-filesystem$(BOOST)-dev libgtest-dev \
-            libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-$(CLANG)-dev \
-            clang-format
+            libgmock-dev libbenchmark-dev cmake ninja-build g++
+# For the fuzzers and the format check only.
+CLANG_PACKAGES := clang libclang-rt-$(CLANG)-dev clang-format
 FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
 VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
 
-.PHONY: all deps build run package test test-asan test-system fuzz bench format format-check clean \
+.PHONY: all deps clang-deps build run package test test-asan test-system fuzz bench format format-check clean \
         windows windows-deps wine-deps test-windows container-deps image test-container test-debian13
 
 all: build
@@ -26,6 +27,10 @@ all: build
 deps:
 	@dpkg -s $(PACKAGES) >/dev/null 2>&1 || { \
 	  apt-get update && DEBIAN_FRONTEND=noninteractive apt-get install -y $(PACKAGES); }
+
+clang-deps:
+	@dpkg -s $(CLANG_PACKAGES) >/dev/null 2>&1 || { \
+	  apt-get update && DEBIAN_FRONTEND=noninteractive apt-get install -y $(CLANG_PACKAGES); }
 
 build/build.ninja:
 	cmake -S . -B build -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo
@@ -66,7 +71,10 @@ test-system: package
 	tests/system/run.sh build/torvad_$(VERSION)_amd64.deb build/demo_core
 
 # --- The OCI image: torvad and the demo product, FROM scratch, offline -------
-CONTAINER_PACKAGES := podman runc conmon containernetworking-plugins catatonit busybox-static
+# podman's network backend: CNI on Debian 12; Debian 13's podman has only netavark.
+NETWORK_bookworm := containernetworking-plugins
+NETWORK_trixie := netavark
+CONTAINER_PACKAGES := podman runc conmon $(NETWORK_$(RELEASE)) catatonit busybox-static
 # podman on the build's own storage: the machine's image store stays as it was.
 IMAGE_PODMAN := packaging/container/podman.sh build/containers
 
@@ -120,7 +128,7 @@ FUZZ_FLAGS_regex := -max_len=129 -dict=fuzz/regex.dict -rss_limit_mb=8192 -mallo
 # Not among the targets: the survey of Boost.Regex as the matcher, which differs
 # (make fuzz FUZZ_TARGETS=regex_boost; FUZZ_REGEX_DIFFERENCES=FILE lists each).
 FUZZ_FLAGS_regex_boost := $(FUZZ_FLAGS_regex)
-fuzz: deps build-fuzz/build.ninja
+fuzz: deps clang-deps build-fuzz/build.ninja
 	cmake --build build-fuzz --target $(addprefix fuzz_,$(FUZZ_TARGETS))
 	$(foreach target,$(FUZZ_TARGETS),mkdir -p build-fuzz/corpus_$(target) && \
 	  ./build-fuzz/fuzz/fuzz_$(target) -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
@@ -138,7 +146,7 @@ bench: build
 format:
 	clang-format -i $$(git ls-files '*.cpp' '*.hpp')
 
-format-check: deps
+format-check: clang-deps
 	clang-format --dry-run -Werror $$(git ls-files '*.cpp' '*.hpp')
 
 clean:

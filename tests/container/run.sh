@@ -6,11 +6,14 @@ set -u
 archive=$(realpath "$1") manifest=$(realpath "$2")
 here=$(dirname "$(realpath "$0")")
 . "$here/../lib.sh"
-store=$(mktemp -d /tmp/torvad-container.XXXXXX)
+podman_sh=$here/../../packaging/container/podman.sh
+# Every podman command of the run in one mount namespace (see podman.sh).
+[ -n "${TORVAD_PODMAN_STORE:-}" ] ||
+    exec "$podman_sh" --enter "$(mktemp -d /tmp/torvad-container.XXXXXX)" "$0" "$@"
+store=$TORVAD_PODMAN_STORE
 touch "$store/started"
 cgroups=/sys/fs/cgroup/pids/libpod_parent
 [ -e "$cgroups" ] && cgroups= # podman's, if it made them: they go at the end
-podman_sh=$here/../../packaging/container/podman.sh
 p() { "$podman_sh" "$store" "$@"; }
 cleanup() {
     [ -n "${listener:-}" ] && kill "$listener" 2>/dev/null
@@ -26,10 +29,10 @@ one_core() { [ "$(cores "$1" | wc -l)" = 1 ]; }
 one_new_core() { one_core demo && [ "$(cores demo)" != "$1" ]; }
 refusals() { [ "$(p logs "${2:-demo}" 2>&1 | grep -c 'refused with status 13')" = "$1" ]; }
 as_nobody() { p top "$1" user comm | awk 'NR > 1 && $1 != "nobody" { bad = 1 } $2 == "core" { core = 1 } END { exit bad || !core }'; }
-untouched() {
+untouched() { # the machine's files as its first process sees them, outside the namespace
     tidy_cgroups
-    [ -z "$(find /var/lib/containers /run/containers /run/libpod /etc/containers /etc/cni \
-        /sys/fs/cgroup/*/libpod_parent -newer "$store/started" 2>/dev/null)" ]
+    [ -z "$(cd /proc/1/root && find var/lib/containers run/containers run/libpod etc/containers \
+        etc/cni /sys/fs/cgroup/*/libpod_parent -newer "$store/started" 2>/dev/null)" ]
 }
 orphans_with_torvad() { p top demo ppid comm | grep -q '^1 *busybox'; }
 no_zombie_no_orphan() { ! p top demo state comm | grep -Eq '^Z|busybox'; }
