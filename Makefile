@@ -46,9 +46,10 @@ run: build
 	PATH="$(CURDIR)/examples/demo/bin:$$PATH" ./build/torvad -v -d examples/demo
 
 # A Debian package of what `cmake --install` puts in place.
+# dpkg-shlibdeps names the libraries it needs, which CPack finds with file(1).
 package: build
-	@command -v dpkg-shlibdeps >/dev/null || \
-	  DEBIAN_FRONTEND=noninteractive apt-get install -y dpkg-dev
+	@dpkg -s dpkg-dev file >/dev/null 2>&1 || { apt-get update && \
+	  DEBIAN_FRONTEND=noninteractive apt-get install -y dpkg-dev file; }
 	cd build && cpack -G DEB
 
 # The format check, the sanitizer run, the fuzzers, the system test and the

@@ -12,9 +12,10 @@ mount --bind /sys "$root/sys"
 mount --rbind /dev "$root/dev"
 for dir in run tmp; do mount -t tmpfs tmpfs "$root/$dir"; done
 mkdir "$cgroup" && echo 0 > "$cgroup/cgroup.procs"
-# No database server, no login prompts on the machine's terminals.
+# No database server, no login prompts on the machine's terminals, no modules
+# loaded into its kernel.
 rm -f "$root"/etc/systemd/system/*.wants/postgresql*
 for unit in getty.target console-getty.service getty@.service serial-getty@.service \
-    container-getty@.service; do ln -sf /dev/null "$root/etc/systemd/system/$unit"; done
+    container-getty@.service systemd-modules-load.service; do ln -sf /dev/null "$root/etc/systemd/system/$unit"; done
 export container=other
 exec unshare --cgroup sh -c 'mount -t cgroup2 cgroup2 "$1/sys/fs/cgroup" && exec chroot "$1" /lib/systemd/systemd --system' sh "$root"
