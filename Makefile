@@ -74,7 +74,7 @@ test-system: package
 # --- The OCI image: torvad and the demo product, FROM scratch, offline -------
 # podman's network backend: CNI on Debian 12; Debian 13's podman has only netavark.
 NETWORK_bookworm := containernetworking-plugins
-NETWORK_trixie := netavark
+NETWORK_trixie := netavark nftables
 CONTAINER_PACKAGES := podman runc conmon $(NETWORK_$(RELEASE)) catatonit busybox-static
 # podman on the build's own storage: the machine's image store stays as it was.
 IMAGE_PODMAN := packaging/container/podman.sh build/containers
