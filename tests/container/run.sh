@@ -1,19 +1,16 @@
 #!/bin/sh
-# The image of `make image` under podman with runc, on a store of the test's own,
-# and the Kubernetes manifest through `podman kube play`. Leaves nothing behind.
+# The image of `make image` under podman with runc, on a store of the test's own
+# where every podman command shares one mount namespace (podman.sh --enter), and
+# the Kubernetes manifest through `podman kube play`. Leaves nothing behind.
 #   tests/container/run.sh build/torvad-image.tar deploy/kubernetes/torvad.yaml
 set -u
 archive=$(realpath "$1") manifest=$(realpath "$2")
 here=$(dirname "$(realpath "$0")")
 . "$here/../lib.sh"
 podman_sh=$here/../../packaging/container/podman.sh
-# Every podman command of the run in one mount namespace (see podman.sh).
-[ -n "${TORVAD_PODMAN_STORE:-}" ] ||
-    exec "$podman_sh" --enter "$(mktemp -d /tmp/torvad-container.XXXXXX)" "$0" "$@"
-store=$TORVAD_PODMAN_STORE
-touch "$store/started"
-cgroups=/sys/fs/cgroup/pids/libpod_parent
-[ -e "$cgroups" ] && cgroups= # podman's, if it made them: they go at the end
+[ -n "${TORVAD_PODMAN_STORE:-}" ] || exec "$podman_sh" --enter "$(mktemp -d /tmp/torvad-container.XXXXXX)" "$0" "$@"
+store=$TORVAD_PODMAN_STORE && touch "$store/started"
+[ -e /sys/fs/cgroup/pids/libpod_parent ] && cgroups= || cgroups=ours # if podman made them, they go at the end
 p() { "$podman_sh" "$store" "$@"; }
 cleanup() {
     [ -n "${listener:-}" ] && kill "$listener" 2>/dev/null
