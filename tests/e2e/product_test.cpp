@@ -54,7 +54,7 @@ TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
         // a stray SIGUSR2 changes nothing; a SIGTERM after the end can't kill
         // us; the manager's socket is ours, not the child's
         {child({"fds"}),
-         {"@STATUS=starting", running_1, "?successfully started", "?child: ready", "!USR2", "!TERM",
+         {"@STATUS=starting", running_1, "&successfully started", "&child: ready", "!USR2", "!TERM",
           stopping_1, "?child: sigterm", "?'test_child' exited with 0x0.", "@STATUS=stopped",
           "!TERM", "=0", "-\x1b", "&child: fds clean", "-notify socket"}},
         // a stop during the start: the first run returns at once, the second
