@@ -166,9 +166,10 @@ daemon_run::daemon_run(const std::vector<std::string>& args, const options& how)
     : console_(under_wine && how.terminal) {
     int theirs = -1;
     open_output(how.terminal, out_fd_, theirs);
-    pid_ = how.first_process
-               ? static_cast<int>(syscall(SYS_clone, CLONE_NEWPID | SIGCHLD, 0, 0, 0, 0))
-               : fork();
+    pid_ =
+        how.first_process
+            ? static_cast<int>(syscall(SYS_clone, CLONE_NEWPID | CLONE_NEWNS | SIGCHLD, 0, 0, 0, 0))
+            : fork();
     if (pid_ == 0)
         exec_daemon(args, how, theirs);
     close(theirs);

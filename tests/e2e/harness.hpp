@@ -23,7 +23,7 @@ struct options {
     std::string shell;             // run first, as a careless parent leaves the start state
     std::string program;           // run instead of torvad
     bool manager = false;          // a service manager of the test's own on NOTIFY_SOCKET
-    bool first_process = false;    // PID 1 of a PID namespace of its own (Linux)
+    bool first_process = false;    // PID 1 of PID and mount namespaces of its own (Linux)
     systems where = systems::both; // where a row of run_rows holds
     bool as_root = false;          // a row of run_rows that holds only when we are root
 };

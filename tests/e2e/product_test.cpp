@@ -134,3 +134,30 @@ TEST(product, the_program_here_starts_with_its_account) {
                       : "");
     }
 }
+
+// core stays silent on "version": the service is handed over to it by a
+// transient systemd timer, its path escaped for the unit file, and torvad
+// ends with 1, leaving its PID file.
+TEST(product, silent_core_hands_the_service_over_and_ends_with_1) {
+    if (!holds_here(systems::linux_only))
+        GTEST_SKIP() << "shell-script stubs are Linux's";
+    installation site;
+    const std::string product = "/a \"b\\ $c%", pid = site.root.path + "/pid";
+    std::filesystem::create_directories(site.root.path + product);
+    site.stub(product + "/core", "echo usage >&2");
+    site.stub("/bin/systemd-run", "");
+    run_scenario({"-f", "acme", "-p", pid, "-d", site.root.path + product},
+                 {"=1", "P" + pid, "-successfully"}, {.env = site.env});
+    const std::string unit = "'/run/systemd/system/acmeServer.service.d";
+    EXPECT_EQ(site.log("systemd-run"),
+              "--unit=startts\n--description=hand the service over to core\n--collect\n--quiet\n"
+              "--on-active=10\n--timer-property=AccuracySec=100ms\n--uid=root\n/bin/sh\n-c\n"
+              "set -e\nmkdir -p " +
+                  unit + "'\ncat > " + unit +
+                  "/handover.conf' <<'END_OF_DROP_IN'\n"
+                  "[Service]\nType=exec\nExecStart=\nExecStart=\"" +
+                  site.root.path +
+                  R"(/a \"b\\ $$$$c%%/core")"
+                  "\nEND_OF_DROP_IN\nsystemctl daemon-reload\n"
+                  "systemctl start torvaSentryServer\n\n---\n");
+}

@@ -1,8 +1,12 @@
 // The bounded matcher where the library's own matcher overflows the stack or
 // never ends, and where it gives up. On short lines and texts it answers as
 // std::regex_match does, quirks included: the differential fuzzer holds that,
-// from seeds that spell each quirk (fuzz/seeds_regex).
+// from seeds that spell each quirk (fuzz/seeds_regex), which are replayed here.
 #include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <regex>
 
 #include "matcher/bounded_regex.hpp"
 #include "platform/platform.hpp"
@@ -42,6 +46,21 @@ TEST(bounded_regex, decides_long_texts_or_gives_up_within_the_bound) {
     };
     for (const auto& [pattern, text, expected] : rows)
         EXPECT_EQ(verdict(pattern, text), expected) << pattern;
+}
+
+// A seed is a pattern, a line feed and a text (or the pattern alone). On "ambiguous" the library
+// takes exponential time; the answer is no.
+TEST(bounded_regex, answers_the_fuzzers_seeds_as_the_library_does) {
+    for (const auto& seed : std::filesystem::directory_iterator(REGEX_SEEDS)) {
+        std::ifstream file(seed.path(), std::ios::binary);
+        std::string input{std::istreambuf_iterator<char>(file), {}};
+        std::size_t cut = input.find('\n');
+        std::string pattern = input.substr(0, cut),
+                    text = cut == input.npos ? "" : input.substr(cut + 1);
+        bool yes_too =
+            seed.path().filename() != "ambiguous" && std::regex_match(text, std::regex(pattern));
+        EXPECT_EQ(verdict(pattern, text), yes_too ? yes : no) << seed.path();
+    }
 }
 
 TEST(bounded_regex, refuses_what_the_library_refuses) {
