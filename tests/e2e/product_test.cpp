@@ -108,8 +108,9 @@ TEST(product, the_program_here_starts_with_its_account) {
         {"echo root; exit 3",
          {"?server init script exited with '3', will not deelevate.", core_ran, "=0"}},
         {nullptr, {"?failed to execute server init script, will not deelevate.", core_ran, "=0"}},
-        // nothing printed: the service manager's socket is kept from the script
-        {"echo $NOTIFY_SOCKET", {core_ran, "=0", "-deelevate", "-failed to open patterns"}},
+        // the service manager's socket is kept from the script, whose account core runs under
+        {"echo ${NOTIFY_SOCKET}nobody",
+         {"?core runs as nobody", "=0", "-deelevate", "-failed to open patterns"}},
         // exec.patterns there (a socket file) but unreadable
         {"printf '\\r\\r\\n'",
          {core_ran, "=0", "-Failed to logon", "&failed to open patterns file 'exec.patterns'"}},
