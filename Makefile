@@ -6,7 +6,8 @@ FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
 VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
 
-.PHONY: all deps build run package test test-asan test-system fuzz bench format format-check clean \
+.PHONY: all deps build run package test test-asan test-system fuzz matcher-equality bench format \
+        format-check clean \
         windows windows-deps test-windows container-deps image test-container
 
 all: build
@@ -106,6 +107,13 @@ fuzz: deps build-fuzz/build.ninja
 	  ./build-fuzz/fuzz/fuzz_$(target) -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
 	    $(FUZZ_FLAGS_$(target)) -artifact_prefix=build-fuzz/$(target)- \
 	    build-fuzz/corpus_$(target) fuzz/seeds_$(target) && ) true
+
+# The parser's automata against libstdc++ 12's own compiler, node for node, over
+# the regex fuzzer's dictionary, seeds and grown corpus; builds only where the
+# fuzz build's library is libstdc++ 12. Not part of `make test`.
+matcher-equality: deps build-fuzz/build.ninja
+	cmake --build build-fuzz --target matcher_equality
+	./build-fuzz/fuzz/matcher_equality fuzz/regex.dict fuzz/seeds_regex build-fuzz/corpus_regex
 
 bench: build
 	./build/bench/bench_framing

@@ -47,8 +47,6 @@ void daemon::load_patterns(const char* path) {
     }
     for (const auto& skipped : file.skipped)
         log_error("%s", describe_skipped(skipped, path).c_str());
-    if (!file.stack_failure.empty())
-        log_error("%s", file.stack_failure.c_str());
 }
 
 void daemon::add_stop_signal(int signal_number) {
