@@ -1,6 +1,5 @@
 #include "matcher/char_classes.hpp"
 
-#include <array>
 #include <string>
 
 namespace torvad::regex {
@@ -22,136 +21,18 @@ const char_set alnum = alpha | digit;
 const char_set space = span('\t', '\r') | span(' ', ' ');
 const char_set graph = span('!', '~');
 
-// The names of the 128 characters of the portable set, in code order; a
-// letter is its own name, a digit is not.
-constexpr std::array<std::string_view, 128> element_names = {"NUL",
-                                                             "SOH",
-                                                             "STX",
-                                                             "ETX",
-                                                             "EOT",
-                                                             "ENQ",
-                                                             "ACK",
-                                                             "alert",
-                                                             "backspace",
-                                                             "tab",
-                                                             "newline",
-                                                             "vertical-tab",
-                                                             "form-feed",
-                                                             "carriage-return",
-                                                             "SO",
-                                                             "SI",
-                                                             "DLE",
-                                                             "DC1",
-                                                             "DC2",
-                                                             "DC3",
-                                                             "DC4",
-                                                             "NAK",
-                                                             "SYN",
-                                                             "ETB",
-                                                             "CAN",
-                                                             "EM",
-                                                             "SUB",
-                                                             "ESC",
-                                                             "IS4",
-                                                             "IS3",
-                                                             "IS2",
-                                                             "IS1",
-                                                             "space",
-                                                             "exclamation-mark",
-                                                             "quotation-mark",
-                                                             "number-sign",
-                                                             "dollar-sign",
-                                                             "percent-sign",
-                                                             "ampersand",
-                                                             "apostrophe",
-                                                             "left-parenthesis",
-                                                             "right-parenthesis",
-                                                             "asterisk",
-                                                             "plus-sign",
-                                                             "comma",
-                                                             "hyphen",
-                                                             "period",
-                                                             "slash",
-                                                             "zero",
-                                                             "one",
-                                                             "two",
-                                                             "three",
-                                                             "four",
-                                                             "five",
-                                                             "six",
-                                                             "seven",
-                                                             "eight",
-                                                             "nine",
-                                                             "colon",
-                                                             "semicolon",
-                                                             "less-than-sign",
-                                                             "equals-sign",
-                                                             "greater-than-sign",
-                                                             "question-mark",
-                                                             "commercial-at",
-                                                             "A",
-                                                             "B",
-                                                             "C",
-                                                             "D",
-                                                             "E",
-                                                             "F",
-                                                             "G",
-                                                             "H",
-                                                             "I",
-                                                             "J",
-                                                             "K",
-                                                             "L",
-                                                             "M",
-                                                             "N",
-                                                             "O",
-                                                             "P",
-                                                             "Q",
-                                                             "R",
-                                                             "S",
-                                                             "T",
-                                                             "U",
-                                                             "V",
-                                                             "W",
-                                                             "X",
-                                                             "Y",
-                                                             "Z",
-                                                             "left-square-bracket",
-                                                             "backslash",
-                                                             "right-square-bracket",
-                                                             "circumflex",
-                                                             "underscore",
-                                                             "grave-accent",
-                                                             "a",
-                                                             "b",
-                                                             "c",
-                                                             "d",
-                                                             "e",
-                                                             "f",
-                                                             "g",
-                                                             "h",
-                                                             "i",
-                                                             "j",
-                                                             "k",
-                                                             "l",
-                                                             "m",
-                                                             "n",
-                                                             "o",
-                                                             "p",
-                                                             "q",
-                                                             "r",
-                                                             "s",
-                                                             "t",
-                                                             "u",
-                                                             "v",
-                                                             "w",
-                                                             "x",
-                                                             "y",
-                                                             "z",
-                                                             "left-curly-bracket",
-                                                             "vertical-line",
-                                                             "right-curly-bracket",
-                                                             "tilde",
-                                                             "DEL"};
+// The names of the 128 characters of the portable set, in code order and
+// apart by blanks; a letter is its own name, a digit is not.
+constexpr std::string_view element_names =
+    "NUL SOH STX ETX EOT ENQ ACK alert backspace tab newline vertical-tab form-feed "
+    "carriage-return SO SI DLE DC1 DC2 DC3 DC4 NAK SYN ETB CAN EM SUB ESC IS4 IS3 IS2 IS1 "
+    "space exclamation-mark quotation-mark number-sign dollar-sign percent-sign ampersand "
+    "apostrophe left-parenthesis right-parenthesis asterisk plus-sign comma hyphen period "
+    "slash zero one two three four five six seven eight nine colon semicolon less-than-sign "
+    "equals-sign greater-than-sign question-mark commercial-at A B C D E F G H I J K L M N O "
+    "P Q R S T U V W X Y Z left-square-bracket backslash right-square-bracket circumflex "
+    "underscore grave-accent a b c d e f g h i j k l m n o p q r s t u v w x y z "
+    "left-curly-bracket vertical-line right-curly-bracket tilde DEL";
 
 char lower_case(char c) {
     return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
@@ -193,9 +74,13 @@ std::optional<char_set> named_class(std::string_view name) {
 }
 
 std::optional<char> collating_element(std::string_view name) {
-    for (std::size_t code = 0; code < element_names.size(); ++code)
-        if (element_names[code] == name)
+    std::size_t first = 0;
+    for (int code = 0; code < 128; ++code) {
+        std::size_t blank = element_names.find(' ', first);
+        if (element_names.substr(first, blank - first) == name)
             return static_cast<char>(code);
+        first = blank + 1;
+    }
     return std::nullopt;
 }
 

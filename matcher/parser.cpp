@@ -24,6 +24,9 @@ const char* const too_large = "too large to compile (more than 100000 automaton 
 struct piece {
     std::int32_t start, end;
 };
+piece single(std::int32_t id) {
+    return {id, id};
+}
 
 // A group or lookahead being read, or the whole line.
 struct frame {
@@ -44,7 +47,7 @@ class parser {
     std::int32_t add(node_kind kind, std::int32_t next = -1, std::int32_t alt = -1,
                      std::uint32_t index = 0, bool negated = false);
     std::int32_t add_set(const char_set& members);
-    void link(piece& to, std::int32_t id) { link(to, piece{id, id}); }
+    void link(piece& to, std::int32_t id) { link(to, single(id)); }
     void link(piece& to, piece from);
     bool take(token kind);
 
@@ -97,7 +100,7 @@ bool parser::take(token kind) {
 
 automaton parser::run() {
     // The whole line is group 0.
-    piece whole{add(node_kind::group_begin), 0};
+    piece whole = single(add(node_kind::group_begin));
     open_groups_.push_back(true);
     groups_ = 1;
     frames_.push_back({frame::kind::whole, false, 0, 0, {}, {}});
@@ -111,8 +114,7 @@ automaton parser::run() {
             node_kind kind = tokens_.kind() == token::line_begin ? node_kind::line_begin
                              : tokens_.kind() == token::line_end ? node_kind::line_end
                                                                  : node_kind::word_boundary;
-            top.terms.push_back({add(kind, -1, -1, 0, tokens_.negated()), 0});
-            top.terms.back().end = top.terms.back().start;
+            top.terms.push_back(single(add(kind, -1, -1, 0, tokens_.negated())));
             tokens_.advance();
             continue;
         }
@@ -178,14 +180,13 @@ void parser::open(frame::kind what, std::int32_t opened) {
 
 // The terms in a row, and a placeholder after the last.
 piece parser::end_alternative(frame& f) {
-    piece whole{add(node_kind::unused), 0};
-    whole.end = whole.start;
+    std::int32_t last = add(node_kind::unused);
     if (f.terms.empty())
-        return whole;
+        return single(last);
     piece row = f.terms.front();
     for (std::size_t i = 1; i < f.terms.size(); ++i)
         link(row, f.terms[i]);
-    link(row, whole);
+    link(row, last);
     f.terms.clear();
     return row;
 }
@@ -198,10 +199,10 @@ void parser::close_frame() {
     if (done.what == frame::kind::lookahead) {
         link(body, add(node_kind::accept));
         std::int32_t id = add(node_kind::lookahead, -1, body.start, 0, done.negated);
-        frames_.back().terms.push_back({id, id});
+        frames_.back().terms.push_back(single(id));
         return;
     }
-    piece term{done.opened, done.opened};
+    piece term = single(done.opened);
     link(term, body);
     if (done.what == frame::kind::group) {
         std::uint32_t group = nodes_[done.opened].index;
@@ -231,11 +232,10 @@ piece parser::atom() {
         id = backref();
         break;
     default: // token::bracket
-        id = add_set(bracket());
-        return {id, id};
+        return single(add_set(bracket()));
     }
     tokens_.advance();
-    return {id, id};
+    return single(id);
 }
 
 std::int32_t parser::backref() {
@@ -390,8 +390,7 @@ void parser::repeat_counted(piece& term, std::size_t at) {
     if (tokens_.kind() != token::count)
         throw bad_pattern{"bad repeat count", at};
     piece original = term;
-    piece result{add(node_kind::unused), 0};
-    result.end = result.start;
+    piece result = single(add(node_kind::unused));
     std::int64_t least = count_value(tokens_.text());
     tokens_.advance();
     bool unbounded = false;

@@ -89,29 +89,14 @@ void scanner::scan_normal(char c) {
         mode_ = mode::in_brace;
         kind_ = token::brace;
         break;
-    case '^':
-        kind_ = token::line_begin;
-        break;
-    case '$':
-        kind_ = token::line_end;
-        break;
-    case '.':
-        kind_ = token::any;
-        break;
-    case '*':
-        kind_ = token::star;
-        break;
-    case '+':
-        kind_ = token::plus;
-        break;
-    case '?':
-        kind_ = token::optional;
-        break;
-    case '|':
-        kind_ = token::alternation;
-        break;
     default:
-        break; // ] and } too are plain characters here
+        // ] and } are plain characters here.
+        static constexpr std::string_view operators = "^$.*+?|";
+        static constexpr token kinds[] = {token::line_begin, token::line_end, token::any,
+                                          token::star,       token::plus,     token::optional,
+                                          token::alternation};
+        if (std::size_t i = operators.find(c); i != std::string_view::npos)
+            kind_ = kinds[i];
     }
 }
 
@@ -161,25 +146,12 @@ void scanner::scan_in_brace(char c) {
 void scanner::scan_escape() {
     char c = source_[next_++];
     kind_ = token::character;
+    static constexpr std::string_view letters = "0fnrtv", meanings("\0\f\n\r\t\v", 6);
+    if (std::size_t i = letters.find(c); i != std::string_view::npos) {
+        character_ = meanings[i];
+        return;
+    }
     switch (c) {
-    case '0':
-        character_ = '\0';
-        return;
-    case 'f':
-        character_ = '\f';
-        return;
-    case 'n':
-        character_ = '\n';
-        return;
-    case 'r':
-        character_ = '\r';
-        return;
-    case 't':
-        character_ = '\t';
-        return;
-    case 'v':
-        character_ = '\v';
-        return;
     case 'b':
     case 'B':
         if (c == 'b' && mode_ == mode::in_bracket) {
