@@ -64,8 +64,9 @@ void stop() {
     wrap::stop_program(program, stop_signal);
 }
 
-// Every sigterm stops the program again; the end of the pipe means torvad is
-// gone, and the program is stopped the same way rather than left behind.
+// The version, first, is read and passed over like any packet but sigterm:
+// the program starts without waiting for it. Every sigterm stops it again; the end of the pipe
+// means torvad is gone, and the program is stopped the same way rather than left behind.
 void follow_link(peer::connection& link) {
     peer::packet packet;
     while (link.receive(packet))
@@ -103,9 +104,6 @@ int run(int argc, char** argv) {
     wrap::watch_own_stop_requests(stop);
     wrap::keep_link_from_program(fd);
     peer::connection link(fd);
-    peer::version_info version;
-    if (!peer::read_version(link, version))
-        return std::fputs("torvad-wrap: no version from torvad.\n", stderr), 5;
     wrap::notify_socket socket;
     if (!options.ready_at_once)
         socket = wrap::open_notify_socket();
