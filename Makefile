@@ -23,11 +23,12 @@ build: deps build/build.ninja
 	cmake --build build
 
 # The demo product in examples/demo: core is found there, the init script runs
-# through the stand-in interpreter, and core fails once so its restart shows.
+# through the stand-in interpreter, core fails once so its restart shows, and
+# the product is ready (-r) once the second core says so.
 run: build
 	cp build/demo_core examples/demo/core
 	rm -f examples/demo/failed-once.marker
-	PATH="$(CURDIR)/examples/demo/bin:$$PATH" ./build/torvad -v -d examples/demo
+	PATH="$(CURDIR)/examples/demo/bin:$$PATH" ./build/torvad -v -r -d examples/demo
 
 # A Debian package of what `cmake --install` puts in place.
 package: build
