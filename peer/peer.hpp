@@ -3,8 +3,9 @@
 // packet owns its payload. Nothing here throws or raises SIGPIPE.
 //
 // A peer's life: take the fd from the last argument, read `version` first,
-// then send `execute` and `stdin` packets and read what comes back, framed by
-// length, until `sigterm` arrives on channel 0; then end with status 0.
+// say `ready` once it serves, send `execute` and `stdin` packets and read
+// what comes back, framed by length, until `sigterm` arrives on channel 0;
+// then end with status 0.
 #pragma once
 
 #include <cstdint>
