@@ -64,9 +64,10 @@ void stop() {
     wrap::stop_program(program, stop_signal);
 }
 
-// The version, first, is read and passed over like any packet but sigterm:
-// the program starts without waiting for it. Every sigterm stops it again; the end of the pipe
-// means torvad is gone, and the program is stopped the same way rather than left behind.
+// The version, first, is passed over like any packet but sigterm: the
+// program starts without waiting for it. Every sigterm stops it again; the
+// end of the pipe means torvad is gone, and the program is stopped the same
+// way rather than left behind.
 void follow_link(peer::connection& link) {
     peer::packet packet;
     while (link.receive(packet))
@@ -93,6 +94,13 @@ void follow_notifications(const wrap::notify_socket& socket, peer::connection& l
             ready = message.substr(at, end - at) == "READY=1" && link.send_ready();
         }
     }
+}
+
+[[noreturn]] void end_with(int status) {
+    std::fflush(nullptr);
+    // The reading threads still use the link on run's stack: end without
+    // unwinding anything.
+    std::_Exit(status);
 }
 
 int run(int argc, char** argv) {
@@ -122,14 +130,11 @@ int run(int argc, char** argv) {
     // A program ended by the very signal sent to stop it has ended cleanly,
     // as service managers count it.
     wrap::program_end end = wrap::wait_for_program(program);
-    return end.signal != 0 && end.signal == stop_sent ? 0 : end.status;
+    end_with(end.signal != 0 && end.signal == stop_sent ? 0 : end.status);
 }
 
 } // namespace
 
 int main(int argc, char** argv) {
-    int status = run(argc, argv);
-    std::fflush(nullptr);
-    // The reading threads still hold the link: end without unwinding them.
-    std::_Exit(status);
+    end_with(run(argc, argv));
 }
