@@ -41,9 +41,11 @@ TEST(wrap, programs_stopped_their_own_way_and_ready_at_their_word) {
          managed},
         // a program that can't be found: one clear line, and the error as the status
         {{"-o", "--", wrap_binary, "no_such_program_xyz"},
-         {"?torvad-wrap: cannot run 'no_such_program_xyz': No such file or directory",
-          "?'torvad-wrap' exited with 0x2.", "=0"},
-         on_linux},
+         {"?torvad-wrap: cannot run 'no_such_program_xyz': ", "?exited with 0x2.", "=0"}},
+        // on either system: ready at once (-i) at a console, and the
+        // program's status (after a second) is the wrapper's
+        {{"-o", "-r", "--", wrap_binary, "-i", child_binary, "exit", "3", "1", "x"},
+         {"?the product is ready.", "?exited with 0x3.", "=0"}},
         // deaf to SIGTERM: torvad keeps waiting and names whom it waits for
         {{"--", wrap_binary, "sh", "-c", "trap '' TERM; echo deaf pid=$$; exec sleep 30"},
          {"#deaf pid", "!INT", stopping, "!INT", "&still waiting for 'torvad-wrap' (pid ", "kill 9",
