@@ -41,11 +41,12 @@ program_end wait_for_program(const running_program& program);
 // The text of an error number, for a log line.
 std::string error_text(int error);
 
-// A datagram socket of our own for the program's notify messages; fd -1 and
-// an empty address where the system has none.
+// A datagram socket of our own for the program's notify messages; fd -1, an
+// empty address and the error where there is none.
 struct notify_socket {
     long fd = -1;
     std::string address;
+    int error = 0;
 };
 notify_socket open_notify_socket();
 // Blocks for the next message into buffer: its size, -1 on an error; a

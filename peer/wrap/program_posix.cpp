@@ -92,18 +92,19 @@ std::string error_text(int error) {
 notify_socket open_notify_socket() {
     int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
     if (fd == -1)
-        return {};
+        return {-1, {}, errno};
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     socklen_t length = sizeof address.sun_family;
     if (bind(fd, reinterpret_cast<sockaddr*>(&address), length) == -1 ||
         (length = sizeof address,
          getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length) == -1)) {
+        int error = errno;
         close(fd);
-        return {};
+        return {-1, {}, error};
     }
     std::string name(address.sun_path + 1, length - sizeof address.sun_family - 1);
-    return {fd, "@" + name};
+    return {fd, "@" + name, 0};
 }
 
 long receive_notification(const notify_socket& socket, char* buffer, std::size_t size,

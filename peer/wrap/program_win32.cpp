@@ -128,7 +128,7 @@ std::string error_text(int error) {
 
 // The notify protocol is systemd's; a Windows program says nothing of the kind.
 notify_socket open_notify_socket() {
-    return {};
+    return {-1, {}, ERROR_NOT_SUPPORTED};
 }
 
 long receive_notification(const notify_socket&, char*, std::size_t, bool& too_long) {

@@ -115,6 +115,11 @@ int run(int argc, char** argv) {
     wrap::notify_socket socket;
     if (!options.ready_at_once)
         socket = wrap::open_notify_socket();
+    if (socket.error != 0)
+        std::fprintf(stderr,
+                     "torvad-wrap: no NOTIFY_SOCKET for the program (%s); -i makes it "
+                     "ready at once.\n",
+                     wrap::error_text(socket.error).c_str());
     if (int error = wrap::start_program(options.command, socket.address, program)) {
         std::fprintf(stderr, "torvad-wrap: cannot run '%s': %s\n", options.command[0].c_str(),
                      wrap::error_text(error).c_str());
