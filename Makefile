@@ -1,7 +1,7 @@
 # The two commands of the README, and the steps they are made of.
 PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
             libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-14-dev \
-            clang-format
+            clang-format redis-server
 FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
 VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
@@ -24,11 +24,12 @@ build: deps build/build.ninja
 	cmake --build build
 
 # The demo product in examples/demo: core is found there, the init script runs
-# through the stand-in interpreter, and core fails once so its restart shows.
+# through the stand-in interpreter, core fails once so its restart shows, and
+# the product is ready (-r) once the second core says so.
 run: build
 	cp build/demo_core examples/demo/core
 	rm -f examples/demo/failed-once.marker
-	PATH="$(CURDIR)/examples/demo/bin:$$PATH" ./build/torvad -v -d examples/demo
+	PATH="$(CURDIR)/examples/demo/bin:$$PATH" ./build/torvad -v -r -d examples/demo
 
 # A Debian package of what `cmake --install` puts in place.
 package: build
@@ -51,8 +52,8 @@ test: build
 # throw-away overlay of / (never on the machine's own /: its tmpfiles step
 # would empty /tmp). Needs root; about a minute.
 test-system: package
-	@dpkg -s systemd util-linux >/dev/null 2>&1 || { apt-get update && \
-	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux; }
+	@dpkg -s systemd util-linux redis-server >/dev/null 2>&1 || { apt-get update && \
+	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux redis-server; }
 	tests/system/run.sh build/torvad_$(VERSION)_amd64.deb build/demo_core
 
 # --- The OCI image: torvad and the demo product, FROM scratch, offline -------

@@ -223,6 +223,9 @@ enum class service_state { start_pending, running, stop_pending, stopped };
 os_error report_service_state(service_state state, std::size_t children);
 // A change of that number while running or stopping; nothing otherwise.
 os_error report_service_children(std::size_t count);
+// A start that is still pending goes on: Windows' manager counts its
+// checkpoints; systemd waits for READY=1 without them.
+os_error report_start_progress();
 
 } // namespace torvad::platform
 

@@ -112,6 +112,19 @@ check "hand-over: core is still active (running) past the start timeout" runs_co
 check "hand-over: the same core, never restarted" test "$main" != 0 -a "$(prop torvad MainPID)" = "$main"
 check "hand-over: the job's unit files stay valid" units_valid
 
+# A server nobody here wrote, under torvad-wrap and -r: the start returns once it
+# serves, though it takes two seconds to begin; the stop is its own shutdown.
+printf '%s\n' '[Service]' 'Type=notify' "ExecStart=torvad -r -- torvad-wrap sh -c 'sleep 2; \
+exec redis-server --supervised systemd --port 6393 --save \"\" --appendonly no'" |
+    put /etc/systemd/system/wrapped.service /dev/stdin
+inside systemctl daemon-reload
+check "a wrapped server: start returns once it serves" inside sh -c \
+    'systemctl start wrapped && redis-cli -p 6393 ping | grep -qx PONG'
+inside systemctl stop wrapped
+check "a wrapped server: its stop is its own" within 10 inside sh -c \
+    "journalctl --no-pager -u wrapped | grep -q 'bye bye'"
+check "a wrapped server: it ends with 0" is wrapped Result success
+
 check "removal: the package goes" inside dpkg -r torvad
 check "removal: the service is stopped" within 10 not inside pgrep -f 'torvad|sleep infinity'
 check "removal: no unit is left" is torvad LoadState not-found
