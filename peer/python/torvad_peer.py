@@ -19,7 +19,8 @@ A packet is a 16-byte header of four little-endian uint32 fields (length,
 channel, type, flags) and length - 16 bytes of payload. As in the C++ peer
 library, nothing here raises on a pipe torvad closed: a send is then False
 and receive() None. Each packet goes out whole in one write, under a lock, so
-threads may share a connection. Standard library only.
+threads may share a connection for sending; one thread receives. Standard
+library only.
 """
 
 import os
@@ -88,9 +89,13 @@ class Connection:
     """Owns a link to torvad (a descriptor, or a pipe handle on Windows)."""
 
     def __init__(self, link, send_timeout=None):
-        self._link = _open_link(link)
-        # Seconds a send may wait for torvad to take the packet; None: no limit.
+        self._link = _Link(link)
+        # Seconds a send may wait in all for torvad to take the packet; None:
+        # no limit.
         self.send_timeout = send_timeout
+        # Once a send gave up with part of its packet out, torvad can't find
+        # where the next one starts: nothing more is sent.
+        self._torn = False
         self._buffer = bytearray()  # bytes read but not yet handed out
         self._send_lock = threading.Lock()
 
@@ -132,7 +137,9 @@ class Connection:
         if block is None:
             return False
         with self._send_lock:
-            return self._link.write(block, self.send_timeout)
+            sent = 0 if self._torn else self._link.write(block, self.send_timeout)
+            self._torn = self._torn or 0 < sent < len(block)
+            return sent == len(block)
 
     def execute(self, channel, flags, items):
         """Asks for items (user with EXECUTE_USER, working directory with
@@ -172,7 +179,7 @@ def connect(argv=None, send_timeout=None):
 if sys.platform == "win32":
     import _winapi
 
-    _ERROR_BROKEN_PIPE, _ERROR_MORE_DATA = 109, 234
+    _ERROR_MORE_DATA = 234
 
     def _link_is_open(value):
         try:
@@ -181,9 +188,10 @@ if sys.platform == "win32":
         except OSError:
             return False
 
-    class _open_link:
-        # torvad opens our end for overlapped input and output, so every read
-        # and write names an OVERLAPPED and waits for its own completion.
+    class _Link:
+        # As on Linux, below. torvad opens our end for overlapped input and
+        # output, so every read and write names an OVERLAPPED and waits for its
+        # own completion.
         def __init__(self, handle):
             self.handle = handle
 
@@ -195,7 +203,7 @@ if sys.platform == "win32":
         def read(self, size):
             try:
                 call, error = _winapi.ReadFile(self.handle, size, overlapped=True)
-                got, error = call.GetOverlappedResult(True)
+                _, error = call.GetOverlappedResult(True)
             except OSError:
                 return b""  # the far end's close shows as a broken pipe
             # A message larger than size comes whole over several reads.
@@ -210,8 +218,8 @@ if sys.platform == "win32":
                         call.cancel()
                 put, error = call.GetOverlappedResult(True)
             except OSError:
-                return False
-            return error == 0 and put == len(data)
+                return 0
+            return put
 
 else:
     import fcntl
@@ -225,9 +233,11 @@ else:
         except OSError:
             return False
 
-    class _open_link:
-        # Sends without SIGPIPE, and without blocking when a wait is bounded:
-        # a socket timeout would bound the reads of other threads too.
+    class _Link:
+        # read() gives b"" at the end or on an error; write() the count of
+        # bytes that went out. Sends go without SIGPIPE, and without blocking
+        # when a wait is bounded: a socket timeout would bound the reads of
+        # other threads too.
         def __init__(self, fd):
             self.socket = socket.socket(fileno=fd)
             self.socket.setblocking(True)
@@ -236,34 +246,32 @@ else:
             self.socket.close()
 
         def read(self, size):
-            while True:
-                try:
-                    return self.socket.recv(size)
-                except InterruptedError:
-                    continue
-                except OSError:
-                    return b""
+            try:
+                return self.socket.recv(size)  # retried by Python on EINTR
+            except OSError:
+                return b""
 
         def write(self, data, timeout):
             flags = socket.MSG_NOSIGNAL | (0 if timeout is None else socket.MSG_DONTWAIT)
             deadline = None if timeout is None else time.monotonic() + timeout
-            view, writable = memoryview(data), select.poll()
+            view, sent, writable = memoryview(data), 0, select.poll()
             writable.register(self.socket, select.POLLOUT)
-            while view:
+            while sent < len(data):
                 try:
-                    view = view[self.socket.send(view, flags):]
+                    sent += self.socket.send(view[sent:], flags)
                 except BlockingIOError:
                     left = max(0, deadline - time.monotonic())
                     if not writable.poll(left * 1000):
-                        return False
+                        break
                 except OSError:
-                    return False
-            return True
+                    break
+            return sent
 
     class AsyncConnection:
         """The same protocol for asyncio (Linux): each packet is one write
         into the transport, so packets never interleave, and drain() is bounded
-        by send_timeout. asyncio is imported by the calls that use it, so that
+        by send_timeout (a send that ran out leaves its packet queued whole, and
+        is False). asyncio is imported by the calls that use it, so that
         a blocking peer starts without it."""
 
         def __init__(self, reader, writer, send_timeout=None):
@@ -285,13 +293,16 @@ else:
         async def receive(self):
             import asyncio
 
+            if self.reader is None:
+                return None
             try:
                 length, *fields = _header.unpack(await self.reader.readexactly(HEADER_SIZE))
-                if not HEADER_SIZE <= length <= MAX_SIZE:
-                    return None
-                return Packet(*fields, await self.reader.readexactly(length - HEADER_SIZE))
+                if HEADER_SIZE <= length <= MAX_SIZE:
+                    return Packet(*fields, await self.reader.readexactly(length - HEADER_SIZE))
+                self.reader = None  # the stream can't be trusted after a bad length
             except (OSError, asyncio.IncompleteReadError):
-                return None
+                pass
+            return None
 
         async def read_version(self):
             first = await self.receive()
