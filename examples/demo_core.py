@@ -74,7 +74,7 @@ def main():
         return 3
     for channel, (_, flags, items) in TOOLS.items():
         link.execute(channel, flags | tp.EXECUTE_STDIO_PIPES, items)
-    link.ready()
+    link.send_ready()
     # 0 tells torvad this was an orderly end, not one to restart.
     return 0 if serve(link) else 1
 

@@ -9,7 +9,7 @@ asks the program to end with `sigterm`, after which it exits 0:
     link = tp.connect()
     if link is None or link.read_version() is None:
         sys.exit(3)
-    link.ready()
+    link.send_ready()
     link.execute(1, tp.EXECUTE_STDIO_PIPES, ["uname", "-sr"])
     for packet in iter(link.receive, None):
         if packet.type == tp.SIGTERM:
@@ -150,8 +150,8 @@ class Connection:
         """Bytes for a channel's standard input; close ends it after them."""
         return self.send(channel, STDIN, STDIN_CLOSE if close else 0, data)
 
-    def ready(self):
-        """Tells torvad that this program is ready to serve."""
+    def send_ready(self):
+        """Tells torvad the program serves: sent once, when it does."""
         return self.send(0, READY)
 
     def _fill(self):
@@ -327,5 +327,5 @@ else:
         async def send_stdin(self, channel, data, close=False):
             return await self.send(channel, STDIN, STDIN_CLOSE if close else 0, data)
 
-        async def ready(self):
+        async def send_ready(self):
             return await self.send(0, READY)

@@ -24,7 +24,7 @@ def promises():
     theirs.sendall(struct.pack("<4I", tp.MAX_SIZE + 1, 0, 0, 0))
     kept = [0.2 <= waited < 5, link.receive() is None, not link.send(0, 0, 0, bytes(tp.MAX_PAYLOAD + 1))]
     theirs.close()
-    return all(kept + [not link.send(0, tp.READY)])
+    return all(kept + [not link.send_ready()])
 
 
 async def serve():
@@ -33,7 +33,7 @@ async def serve():
     say(f"version {version.program_name} {version.version}")
     await link.execute(1, tp.EXECUTE_STDIO_PIPES, ["cat"])
     await link.send_stdin(1, b"relayed through cat", close=True)
-    await link.ready()
+    await link.send_ready()
     while (packet := await link.receive()) is not None:
         if packet.type == tp.STDOUT:
             say("cat says: " + packet.payload.decode())
