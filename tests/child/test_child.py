@@ -22,7 +22,8 @@ def promises():
         pass
     waited = time.monotonic() - started
     theirs.sendall(struct.pack("<4I", tp.MAX_SIZE + 1, 0, 0, 0))
-    kept = [0.2 <= waited < 5, link.receive() is None, not link.send(0, 0, 0, bytes(tp.MAX_PAYLOAD + 1))]
+    too_large = bytes(tp.MAX_PAYLOAD + 1)
+    kept = [0.2 <= waited < 5, link.receive() is None, not link.send(0, tp.STDIN, 0, too_large)]
     theirs.close()
     return all(kept + [not link.send_ready()])
 
