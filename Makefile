@@ -1,7 +1,7 @@
 # The two commands of the README, and the steps they are made of.
 PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
             libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-14-dev \
-            clang-format redis-server
+            clang-format redis-server python3
 FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
 VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
@@ -26,10 +26,13 @@ build: deps build/build.ninja
 # The demo product in examples/demo: core is found there, the init script runs
 # through the stand-in interpreter, core fails once so its restart shows, and
 # the product is ready (-r) once the second core says so.
+# DEMO_CORE=examples/demo_core.py runs the core written in Python instead.
+DEMO_CORE ?= build/demo_core
 run: build
-	cp build/demo_core examples/demo/core
+	cp $(DEMO_CORE) examples/demo/core
 	rm -f examples/demo/failed-once.marker
-	PATH="$(CURDIR)/examples/demo/bin:$$PATH" ./build/torvad -v -r -d examples/demo
+	PYTHONPATH="$(CURDIR)/peer/python" PATH="$(CURDIR)/examples/demo/bin:$$PATH" \
+	  ./build/torvad -v -r -d examples/demo
 
 # A Debian package of what `cmake --install` puts in place.
 package: build

@@ -51,6 +51,9 @@ printf '[Manager]\nDefaultTimeoutStartSec=4s\n' | put /etc/systemd/system.conf.d
 
 put /var/tmp/torvad.deb "$deb"
 check "the package installs" inside dpkg -i /var/tmp/torvad.deb
+# Compiled on import, as root's python3 does, beside the file.
+check "Debian's python3 finds the Python peer" \
+    inside env -u PYTHONDONTWRITEBYTECODE /usr/bin/python3 -c "import torvad_peer"
 # -l: each line is also a record of the system's log, of its level's priority,
 # with torvad's name and pid, its text alone; without -l, none.
 logged() { inside journalctl --no-pager -o verbose SYSLOG_IDENTIFIER=torvad SYSLOG_FACILITY=3 \
@@ -129,4 +132,5 @@ check "removal: the package goes" inside dpkg -r torvad
 check "removal: the service is stopped" within 10 not inside pgrep -f 'torvad|sleep infinity'
 check "removal: no unit is left" is torvad LoadState not-found
 check "removal: no alias is left" inside test ! -L /etc/systemd/system/torvaSentryServer.service
+check "removal: no Python peer is left" test -z "$(inside find /usr/lib/python3 -name 'torvad_peer*')"
 summary " ($(($(date +%s) - start)) s)"
