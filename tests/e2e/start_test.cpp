@@ -59,8 +59,9 @@ TEST(start, options_help_and_the_pid_file) {
         {{"-p", pid, "-v", "-h", "-p"},
          {"?torvad version 1.1.21.0\nUsage: " + torvad_binary +
               " <options> -- <exe> <exe args>\n  -h  help\n  -v  verbose\n  -l  enable logging\n"
-              "  -b  start service\n  -o  disable auto restart after failure\n  -f  <product "
-              "family>\n  -u  <user>\n  -d  <directory>\n  -p  <pid file>\n  -a  <pid> <pipe>\n",
+              "  -b  start service\n  -o  disable auto restart after failure\n  -r  ready once all "
+              "children say so\n  -f  <product family>\n  -u  <user>\n  -d  <directory>\n  -p  "
+              "<pid file>\n  -a  <pid> <pipe>\n",
           "=0", "-successfully"},
          pipe},
         {{"-v", "-l", "--", child_binary, "exit", "0"}, {"=0", "-torvad", "-child"}, pipe},
