@@ -11,15 +11,16 @@ BOOST := $(BOOST_$(RELEASE))
 CLANG := $(CLANG_$(RELEASE))
 $(if $(BOOST),,$(error torvad builds on Debian 12 (bookworm) or 13 (trixie), not on '$(RELEASE)'))
 PACKAGES := libboost$(BOOST)-dev libboost-filesystem$(BOOST)-dev libgtest-dev \
-            libgmock-dev libbenchmark-dev cmake ninja-build g++
+            libgmock-dev libbenchmark-dev cmake ninja-build g++ redis-server python3
 # For the fuzzers and the format check only.
 CLANG_PACKAGES := clang libclang-rt-$(CLANG)-dev clang-format
 FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
 VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
 
-.PHONY: all deps clang-deps build run package test test-asan test-system fuzz bench format format-check clean \
-        windows windows-deps wine-deps test-windows container-deps image test-container test-debian13
+.PHONY: all deps clang-deps build run package test test-asan test-system fuzz matcher-equality bench \
+        format format-check clean windows windows-deps wine-deps test-windows container-deps image \
+        test-container test-debian13
 
 all: build
 
@@ -39,11 +40,15 @@ build: deps build/build.ninja
 	cmake --build build
 
 # The demo product in examples/demo: core is found there, the init script runs
-# through the stand-in interpreter, and core fails once so its restart shows.
+# through the stand-in interpreter, core fails once so its restart shows, and
+# the product is ready (-r) once the second core says so.
+# DEMO_CORE=examples/demo_core.py runs the core written in Python instead.
+DEMO_CORE ?= build/demo_core
 run: build
-	cp build/demo_core examples/demo/core
+	cp $(DEMO_CORE) examples/demo/core
 	rm -f examples/demo/failed-once.marker
-	PATH="$(CURDIR)/examples/demo/bin:$$PATH" ./build/torvad -v -d examples/demo
+	PYTHONPATH="$(CURDIR)/peer/python" PATH="$(CURDIR)/examples/demo/bin:$$PATH" \
+	  ./build/torvad -v -r -d examples/demo
 
 # A Debian package of what `cmake --install` puts in place.
 # dpkg-shlibdeps names the libraries it needs, which CPack finds with file(1).
@@ -67,8 +72,8 @@ test: build
 # throw-away overlay of / (never on the machine's own /: its tmpfiles step
 # would empty /tmp). Needs root; about a minute.
 test-system: package
-	@dpkg -s systemd util-linux >/dev/null 2>&1 || { apt-get update && \
-	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux; }
+	@dpkg -s systemd util-linux redis-server >/dev/null 2>&1 || { apt-get update && \
+	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux redis-server; }
 	tests/system/run.sh build/torvad_$(VERSION)_amd64.deb build/demo_core
 
 # --- The OCI image: torvad and the demo product, FROM scratch, offline -------
@@ -135,6 +140,13 @@ fuzz: deps clang-deps build-fuzz/build.ninja
 	  ./build-fuzz/fuzz/fuzz_$(target) -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
 	    $(FUZZ_FLAGS_$(target)) -artifact_prefix=build-fuzz/$(target)- \
 	    build-fuzz/corpus_$(target) fuzz/seeds_$(target) && ) true
+
+# The parser's automata against libstdc++ 12's own compiler, node for node, over
+# the regex fuzzer's dictionary, seeds and grown corpus; builds only where the
+# fuzz build's library is libstdc++ 12. Not part of `make test`.
+matcher-equality: deps clang-deps build-fuzz/build.ninja
+	cmake --build build-fuzz --target matcher_equality
+	./build-fuzz/fuzz/matcher_equality fuzz/regex.dict fuzz/seeds_regex build-fuzz/corpus_regex
 
 bench: build
 	./build/bench/bench_framing

@@ -15,6 +15,7 @@
 #include <poll.h>
 #include <pty.h>
 #include <regex>
+#include <sched.h>
 #include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -155,6 +156,7 @@ const std::string child_binary = built(TEST_CHILD_BINARY, "tests/test_child");
 const std::string child_file =
     windows_build ? std::string(windows_build) + "/tests/test_child.exe" : TEST_CHILD_BINARY;
 const std::string tool_binary = built(TORVAD_PATTERNS_BINARY, "torvad-patterns.exe");
+const std::string wrap_binary = built(TORVAD_WRAP_BINARY, "torvad-wrap.exe");
 const std::string torvad_name = windows_build ? "torvad.exe" : "torvad";
 
 bool holds_here(systems where) {
@@ -165,7 +167,10 @@ daemon_run::daemon_run(const std::vector<std::string>& args, const options& how)
     : console_(under_wine && how.terminal) {
     int theirs = -1;
     open_output(how.terminal, out_fd_, theirs);
-    pid_ = fork();
+    pid_ =
+        how.first_process
+            ? static_cast<int>(syscall(SYS_clone, CLONE_NEWPID | CLONE_NEWNS | SIGCHLD, 0, 0, 0, 0))
+            : fork();
     if (pid_ == 0)
         exec_daemon(args, how, theirs);
     close(theirs);
@@ -284,8 +289,11 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
         else if (step == "@*" && manager)
             while (!manager->next(0).empty()) {
             }
-        else if (step[0] == '@' && manager)
-            EXPECT_EQ(manager->next(text.empty() ? 0 : event_wait_ms), text) << out;
+        else if (std::string got; step[0] == '@' && manager)
+            EXPECT_TRUE(std::regex_match(got = manager->next(text.empty() ? 0 : event_wait_ms),
+                                         std::regex(text)))
+                << text << " got " << got << "\n"
+                << out;
         else if (step[0] == '#')
             child = run.wait_for(text + "=") ? std::atoi(out.c_str() + run.cursor_) : -1;
         else if (step.rfind("kill ", 0) == 0 && child > 0)
@@ -296,6 +304,8 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
                           "\n");
         else if (step[0] == '=')
             EXPECT_EQ(run.wait_exit(), std::atoi(text.c_str())) << out;
+        else if (step[0] == '$')
+            EXPECT_EQ(std::system(text.c_str()), 0) << text << "\n" << out;
         else if (step == "z")
             EXPECT_TRUE(no_zombie_within(run.pid_, event_wait_ms)) << out;
         else if (step[0] == '&')

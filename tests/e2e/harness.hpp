@@ -11,7 +11,8 @@ namespace e2e {
 extern const bool under_wine;
 // The programs as torvad names them; the name torvad's version packet gives
 // it; the test child's file as this system names it.
-extern const std::string torvad_binary, child_binary, tool_binary, torvad_name, child_file;
+extern const std::string torvad_binary, child_binary, tool_binary, wrap_binary, torvad_name,
+    child_file;
 
 enum class systems { both, linux_only, windows_only };
 bool holds_here(systems where);
@@ -23,6 +24,7 @@ struct options {
     std::string shell;             // run first, as a careless parent leaves the start state
     std::string program;           // run instead of torvad
     bool manager = false;          // a service manager of the test's own on NOTIFY_SOCKET
+    bool first_process = false;    // PID 1 of PID and mount namespaces of its own (Linux)
     systems where = systems::both; // where a row of run_rows holds
     bool as_root = false;          // a row of run_rows that holds only when we are root
 };
@@ -37,7 +39,8 @@ inline const options on_linux{.where = systems::linux_only},
 //   "&text" waits for text anywhere                 "z" no child of torvad is a zombie
 //   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
 //   "Ppath" the file at path holds torvad's pid and a line feed
-// With a manager: "@message" expects its next report, "@*" drops those still
+//   "$command" a shell command of the test's own, which must succeed
+// With a manager: "@message" expects its next report (a regex), "@*" drops those still
 // unread, "@" expects none, "!USR2" sends torvad a SIGUSR2.
 // Under Wine every stop request is Ctrl-C typed at the console.
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,

@@ -2,6 +2,7 @@
 // asks for channels, and the test reads what comes back in the loop's turns.
 #include <gtest/gtest.h>
 
+#include <csignal>
 #include <fstream>
 #include <functional>
 #include <linux/sockios.h>
@@ -43,6 +44,7 @@ struct rig final : process_owner {
     // send_buffer, when given, bounds what torvad's end of the socket holds.
     explicit rig(bool verbose = false, int send_buffer = 0) {
         run.verbose = verbose;
+        signal(SIGPIPE, SIG_IGN); // as torvad's start does: a child that ended closed its end
         int ends[2];
         EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);
         if (send_buffer != 0)
@@ -247,7 +249,7 @@ TEST(process, packets_are_framed_across_reads_and_traced) {
          {"<- peer:5 stdin abc", "channel 0x5 does not exist"}},
         {{packet_bytes(7, packet_stdin, 0, "", 15) + stdin5, stdin6},
          {"bad ipc packet length", "<- peer:6 stdin x flags=0x1", "channel 0x6 does not exist"}},
-        {{packet_bytes(0x500003, 9, 4, "zz") + packet_bytes(1, packet_sigterm, 0, "")},
+        {{packet_bytes(0x500003, 10, 4, "zz") + packet_bytes(1, packet_sigterm, 0, "")},
          {"<- peer:psfile:3 unknown ", "<- peer:1 sigterm "}},
     };
     for (auto [pieces, lines] : rows) {
