@@ -109,8 +109,13 @@ class daemon final : public process_owner {
     platform::stream orphan_watch_;
     pattern_lists patterns_;
     bool children_report_posted_ = false;
-    bool stop_requested_ = false;
-    bool shut_down_ = false;
+    // The daemon's life; a stop or the shutdown moves it:
+    //   state      stop                              shut_down
+    //   running    -> stopping                       -> shut_down
+    //   stopping   names whom it waits for           -> shut_down
+    //   shut_down  nothing                           nothing
+    enum class life { running, stopping, shut_down };
+    life life_ = life::running;
 };
 
 } // namespace torvad

@@ -122,10 +122,11 @@ os_error attach_pipe(stream& ours, std::int64_t value);
 // stream has ended.
 boost::system::error_code take_output(stream& pipe, output_buffer& buffer, const char*& data,
                                       std::size_t& size);
-// True while a read armed by await_output may still land bytes: what is in the
-// pipe behind them can't be taken before it has. Ends such a read early.
-bool output_in_flight(const output_buffer& buffer);
-void cut_output_short(stream& pipe);
+// The writer of pipe has ended, so what the pipe holds is all there will be.
+// True when take_output can now take all of it; false while a read armed by
+// await_output may still land bytes ahead of the rest: that read is ended
+// early, its handler runs next, and then this is asked again.
+bool end_output(stream& pipe, output_buffer& buffer);
 
 // --- launching and ending children ---------------------------------------------
 

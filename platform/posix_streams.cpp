@@ -81,10 +81,8 @@ boost::system::error_code take_output(stream& pipe, output_buffer&, const char*&
 }
 
 // Readiness moves no bytes: nothing is ever on its way.
-bool output_in_flight(const output_buffer&) {
-    return false;
+bool end_output(stream&, output_buffer&) {
+    return true;
 }
-
-void cut_output_short(stream&) {}
 
 } // namespace torvad::platform

@@ -180,14 +180,14 @@ boost::system::error_code take_output(stream& pipe, output_buffer& buffer, const
     return error;
 }
 
-bool output_in_flight(const output_buffer& buffer) {
-    return buffer.reading;
-}
-
-// The read completes at once: with what it had already read, or with nothing.
-void cut_output_short(stream& pipe) {
+// A read on its way completes at once: with what it had already read, or
+// with nothing.
+bool end_output(stream& pipe, output_buffer& buffer) {
+    if (!buffer.reading)
+        return true;
     boost::system::error_code ignored;
     pipe.cancel(ignored);
+    return false;
 }
 
 } // namespace torvad::platform

@@ -67,7 +67,7 @@ struct rig final : process_owner {
     void child_ended(const process& child, std::uint32_t status) override {
         ended.push_back(status);
         if (restart_killed && status > 128)
-            process::create(*this, child.request(), child.place())->start();
+            process::create(*this, child.what, child.place)->start();
     }
     const pattern_lists& patterns() const override { return everything; }
     const run_facts& facts() const override { return run; }
