@@ -46,8 +46,9 @@ std::string describe(const os_error& error);
 
 // Makes the start state whatever the parent left: standard streams open,
 // exits of children observable, a peer closing its end only a write error,
-// and no signal blocked.
-void prepare_own_process();
+// and no signal blocked. An error names the first step that failed; the
+// others are made all the same.
+os_error prepare_own_process();
 // Each log line reaches stdout as it is written, with its line feed as it is.
 void unbuffer_output();
 int current_process_id();
@@ -214,7 +215,7 @@ bool reap_orphans(stream& watch);
 
 // Keeps the service manager's stop request (SIGTERM) pending until the
 // dispatcher waits for it, so that it can't end us by its default action.
-void hold_stop_requests();
+os_error hold_stop_requests();
 // Runs service_main on a thread of its own when the service manager started us
 // (or a container runtime, which stands for it), delivering stop requests to
 // on_stop from this thread; false at once otherwise. service_main runs only

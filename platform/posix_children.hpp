@@ -9,6 +9,8 @@
 #include <sys/wait.h>
 #include <vector>
 
+#include "platform/platform.hpp"
+
 namespace torvad::platform {
 
 // Held from a launch to the note of its pid, and from an orphan's peek to its
@@ -29,8 +31,8 @@ struct account {
     std::vector<unsigned> groups;
 };
 
-// Resolves "domain\name" (empty domain or "." is this machine). Returns 0, or
-// the errno-like reason the logon is refused.
-int resolve_account(const std::string& user, account& out);
+// Resolves "domain\name" (empty domain or "." is this machine); an error is
+// the reason the logon is refused.
+os_error resolve_account(const std::string& user, account& out);
 
 } // namespace torvad::platform

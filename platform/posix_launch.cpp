@@ -111,13 +111,18 @@ int become_child(void* argument) {
 }
 
 // The child's stack, made once: launches happen on one thread at a time.
+// Null when it could not be made, and error says why.
 constexpr std::size_t child_stack_size = 64 * 1024;
-char* child_stack_top() {
+char* child_stack_top(os_error& error) {
+    static os_error failed;
     static char* top = [] {
         void* stack = mmap(nullptr, child_stack_size, PROT_READ | PROT_WRITE,
                            MAP_PRIVATE | MAP_ANONYMOUS | MAP_STACK, -1, 0);
+        if (stack == MAP_FAILED)
+            failed = {errno, "mmap"};
         return stack == MAP_FAILED ? nullptr : static_cast<char*>(stack) + child_stack_size;
     }();
+    error = failed;
     return top;
 }
 
@@ -142,21 +147,30 @@ launch_result failed_launch(launch_step step, os_error error) {
 }
 
 launch_result clone_child(child_plan& plan) {
-    char* stack = child_stack_top();
+    os_error stack_error;
+    char* stack = child_stack_top(stack_error);
     if (stack == nullptr)
-        return failed_launch(launch_step::create, {ENOMEM, "mmap"});
+        return failed_launch(launch_step::create, stack_error);
     sigset_t all, saved;
     sigfillset(&all);
-    pthread_sigmask(SIG_SETMASK, &all, &saved);
+    if (int error = pthread_sigmask(SIG_SETMASK, &all, &saved))
+        return failed_launch(launch_step::create, {error, "pthread_sigmask"});
     // Noted before the guard goes: an orphan reap must never see it unnoted.
     std::lock_guard<std::mutex> lock(supervised_guard);
     int pidfd = -1;
     pid_t pid = clone(become_child, stack,
                       CLONE_VM | CLONE_FILES | CLONE_VFORK | CLONE_PIDFD | SIGCHLD, &plan, &pidfd);
     int clone_error = errno;
-    pthread_sigmask(SIG_SETMASK, &saved, nullptr);
+    int restore_error = pthread_sigmask(SIG_SETMASK, &saved, nullptr);
     if (pid == -1)
         return failed_launch(launch_step::create, {clone_error, "clone"});
+    // Our signals stay blocked: that launch fails, its child ended, unless it
+    // can't be ended, and then it is supervised as any other.
+    bool undo = restore_error != 0 && plan.failed_step == launch_step::none;
+    if (undo && syscall(SYS_pidfd_send_signal, pidfd, SIGKILL, nullptr, 0) == 0) {
+        plan.failed_step = launch_step::create;
+        plan.error = {restore_error, "pthread_sigmask"};
+    }
     if (plan.failed_step == launch_step::none) {
         note_supervised(static_cast<int>(pid));
         launch_result result;
@@ -167,7 +181,9 @@ launch_result clone_child(child_plan& plan) {
     // It has called _exit already; reap it so that no zombie stays behind.
     // Its pid was never noted, and the guard we hold keeps it from the orphans.
     siginfo_t info{};
-    waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED);
+    while (waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED) == -1 &&
+           errno == EINTR) {
+    }
     close(pidfd);
     return failed_launch(plan.failed_step, plan.error);
 }
@@ -271,8 +287,8 @@ launch_result launch_child(const launch_request& request) {
     static_assert(sizeof(unsigned) == sizeof(gid_t));
     account user;
     if (!request.user.empty())
-        if (int refused = resolve_account(request.user, user))
-            return failed_launch(launch_step::logon, {refused, "resolve account"});
+        if (os_error refused = resolve_account(request.user, user))
+            return failed_launch(launch_step::logon, refused);
     std::vector<char*> argv;
     for (const auto& argument : request.argv)
         argv.push_back(const_cast<char*>(argument.c_str()));

@@ -62,9 +62,10 @@ os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) 
 }
 
 os_error attach_pipe(stream& ours, std::int64_t value) {
-    int fd = static_cast<int>(value);
-    if (value < 0 || value != fd || fcntl(fd, F_GETFD) == -1)
-        return {EBADF, "fcntl"};
+    // A value that is no descriptor number is asked as -1, which none is.
+    int fd = value < 0 || value != static_cast<int>(value) ? -1 : static_cast<int>(value);
+    if (fcntl(fd, F_GETFD) == -1)
+        return {errno, "fcntl"};
     owned_handle given(fd);
     os_error error = bind(ours, given);
     // A descriptor that was given to us stays open, whatever we could do with it.

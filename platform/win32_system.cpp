@@ -50,9 +50,11 @@ BOOL WINAPI stop_on_console_event(DWORD event) {
 // Windows starts us as we are: standard handles that are missing stay null,
 // and a child's end is seen on its process handle, not by a signal. Whichever
 // console handler is asked first, the runtime's takes Ctrl-C alone. Without
-// ours (there is no log yet to say so), those events end us as before.
-void prepare_own_process() {
-    SetConsoleCtrlHandler(stop_on_console_event, TRUE);
+// ours, those events end us as before, and -v says why.
+os_error prepare_own_process() {
+    if (!SetConsoleCtrlHandler(stop_on_console_event, TRUE))
+        return {static_cast<int>(GetLastError()), "SetConsoleCtrlHandler"};
+    return {};
 }
 
 void unbuffer_output() {
