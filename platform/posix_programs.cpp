@@ -59,7 +59,7 @@ void relay_until_end(int source, int pidfd, const output_handler& on_output) {
 
 int wait_for_exit_code(int pidfd) {
     siginfo_t info{};
-    if (wait_supervised(pidfd, info, WEXITED) == -1)
+    if (child_registry::instance().wait_supervised(pidfd, info, WEXITED) == -1)
         return -1;
     return info.si_code == CLD_EXITED ? info.si_status
                                       : static_cast<int>(signal_status(info.si_status));
