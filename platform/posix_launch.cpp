@@ -46,14 +46,18 @@ struct child_plan {
 
 // Default dispositions before the mask opens, so no handler of ours can
 // ever run in the child.
-void reset_signals() {
+void reset_signals(child_plan& plan) {
     struct sigaction default_action {};
     default_action.sa_handler = SIG_DFL;
+    // SIGKILL, SIGSTOP and the C library's own numbers refuse with EINVAL,
+    // and are left as they are.
     for (int signal_number = 1; signal_number < NSIG; ++signal_number)
-        sigaction(signal_number, &default_action, nullptr);
+        if (sigaction(signal_number, &default_action, nullptr) == -1 && errno != EINVAL)
+            give_up(plan, launch_step::create, "sigaction");
     sigset_t empty;
     sigemptyset(&empty);
-    sigprocmask(SIG_SETMASK, &empty, nullptr);
+    if (sigprocmask(SIG_SETMASK, &empty, nullptr) == -1)
+        give_up(plan, launch_step::create, "sigprocmask");
 }
 
 // The raw system calls: glibc's wrappers of these would signal every thread
@@ -96,7 +100,7 @@ void keep_own_descriptors(child_plan& plan) {
 int become_child(void* argument) {
     child_plan& plan = *static_cast<child_plan*>(argument);
     const launch_request& request = *plan.request;
-    reset_signals();
+    reset_signals(plan);
     if (request.own_process_group && setpgid(0, 0) == -1)
         give_up(plan, launch_step::create, "setpgid");
     if (plan.user->change)
@@ -244,10 +248,11 @@ bool continue_if_stopped(exit_watch& watch) {
 
 void end_now(owned_handle& process) {
     // A child we can't watch is one we never started as far as anyone knows:
-    // a failed kill leaves nothing better to do than reap what we can.
-    (void)signal_child(process.get(), SIGKILL);
+    // a failed kill leaves nothing better to do than reap what we can, without
+    // waiting for one that may run on.
+    int options = signal_child(process.get(), SIGKILL) ? WEXITED | WNOHANG : WEXITED;
     siginfo_t info{};
-    if (child_registry::instance().wait_supervised(process.get(), info, WEXITED) == -1)
+    if (child_registry::instance().wait_supervised(process.get(), info, options) == -1)
         info.si_pid = 0;
     process.reset();
 }

@@ -66,7 +66,9 @@ bool change_directory(const std::string& path) {
 std::tm local_time_now() {
     std::time_t now = std::time(nullptr);
     std::tm local{};
-    localtime_r(&now, &local);
+    // A time that can't be broken down is stamped with zeros.
+    if (localtime_r(&now, &local) == nullptr)
+        return {};
     return local;
 }
 
