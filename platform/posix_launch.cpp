@@ -235,8 +235,12 @@ bool continue_if_stopped(exit_watch& watch) {
     // WNOWAIT leaves the stop to be seen again: the next stop request asks
     // anew. Not through wait_supervised, which takes what it sees for an end.
     siginfo_t info{};
-    if (waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(watch.native_handle()), &info,
-               WSTOPPED | WNOHANG | WNOWAIT) == -1)
+    int waited;
+    do
+        waited = waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(watch.native_handle()),
+                        &info, WSTOPPED | WNOHANG | WNOWAIT);
+    while (waited == -1 && errno == EINTR);
+    if (waited == -1)
         return false;
     if (info.si_pid == 0 || info.si_code != CLD_STOPPED)
         return false;

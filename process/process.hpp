@@ -62,8 +62,9 @@ class process : public std::enable_shared_from_this<process> {
     // Takes an event of its life through the table (process/life.hpp) and
     // does what it calls for. The parts report theirs here.
     void on(life_event event, std::uint32_t value = 0);
-    // What a channel of this process uses: its link to send, and to hold
-    // back, and the streams the link routes stdin to.
+    // What its channels and its requester use of it: the link its channels
+    // send on and wait at; and its streams, which its requester's link
+    // routes stdin to, wakes when there is room, and closes at its end.
     requester_link& link() { return link_; }
     relayed_streams& streams() { return streams_; }
 
