@@ -68,6 +68,8 @@ void ipc_link::on_packet(const packet_header& header, const char* payload) {
         route_stdin(header, payload);
     else if (header.type == packet_execute)
         execute(header, payload);
+    else if (header.type == packet_ready && header.channel == 0)
+        self_.owner.child_ready(self_);
 }
 
 void ipc_link::route_stdin(const packet_header& header, const char* payload) {
