@@ -145,8 +145,9 @@ struct launch_request {
 
 // Where a launch failed: the logon to the account, or making the child; or
 // the program was refused, being one whose arguments a command interpreter
-// would read (a batch file on Windows).
-enum class launch_step { none, logon, create, refused };
+// would read (a batch file on Windows), or an item of the launch is no text
+// of the system's code page (unconvertible, on Windows).
+enum class launch_step { none, logon, create, refused, unconvertible };
 
 struct launch_result {
     int pid = 0;

@@ -81,6 +81,11 @@ bool process::start() {
                         command[0].c_str());
         return fail_launch(launched.error.code, launched.error);
     }
+    if (launched.failed_step == platform::launch_step::unconvertible) {
+        owner.log_error("refused to run '%s': an item is no text of the system's code page.",
+                        command[0].c_str());
+        return fail_launch(launched.error.code, launched.error);
+    }
     if (launched.failed_step != platform::launch_step::none) {
         owner.log_error("failed to create child process.");
         return fail_launch(launched.error.code, launched.error);

@@ -2,22 +2,26 @@
 
 #include <tlhelp32.h>
 
+#include <cstdio>
+#include <cstdlib>
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
 #include <io.h>
+#include <sstream>
 
+#include "peer/peer.hpp"
 #include "tests/child/child_host.hpp"
 
 namespace child_host {
 
-// Ctrl-Break at the console reaches every program on it, whatever its group
-// (Ctrl-C is off in the group of its own that torvad gives each child); a
-// peer ends by its sigterm packet, as it does when torvad runs as a service.
+// A console's events reach every program on it, whatever its group (Ctrl-C
+// is off in the group of its own that torvad gives each child); a peer ends
+// by its sigterm packet, as it does when torvad runs as a service.
 void prepare_streams() {
     for (int stream : {0, 1, 2})
         _setmode(stream, _O_BINARY);
-    SetConsoleCtrlHandler([](DWORD event) -> BOOL { return event == CTRL_BREAK_EVENT; }, TRUE);
+    torvad::peer::outlive_console_events();
 }
 
 // A process's handles can't be listed here, and no row asks after the account.
@@ -42,30 +46,56 @@ static DWORD parent_id() {
     return parent;
 }
 
-// Left open until we end, as a squatter would hold it.
-bool take_pipe_name(int n) {
-    std::string name =
-        "\\\\.\\pipe\\torvad_" + std::to_string(parent_id()) + "_" + std::to_string(n);
-    return CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX, PIPE_TYPE_BYTE,
-                            PIPE_UNLIMITED_INSTANCES, 4096, 4096, 0,
-                            nullptr) != INVALID_HANDLE_VALUE;
+// Left open until we end, as a squatter would hold them; they never wait,
+// so that a look at them tells whether anybody connected.
+std::vector<HANDLE> taken_pipes;
+
+bool take_pipe_names(const std::string& calls) {
+    std::istringstream list(calls);
+    for (std::string call; std::getline(list, call, ',');) {
+        char byte[3];
+        std::snprintf(byte, sizeof byte, "%02x", std::atoi(call.c_str()) & 0xff);
+        std::string name = "\\\\.\\pipe\\torvad_";
+        for (int i = 0; i < 16; ++i)
+            name += byte;
+        HANDLE pipe =
+            CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX, PIPE_TYPE_BYTE | PIPE_NOWAIT,
+                             PIPE_UNLIMITED_INSTANCES, 4096, 4096, 0, nullptr);
+        if (pipe == INVALID_HANDLE_VALUE)
+            return false;
+        taken_pipes.push_back(pipe);
+    }
+    return !taken_pipes.empty();
+}
+
+bool taken_pipe_connected() {
+    for (HANDLE pipe : taken_pipes)
+        if (!ConnectNamedPipe(pipe, nullptr) && GetLastError() != ERROR_PIPE_LISTENING)
+            return true;
+    return false;
 }
 
 // GenerateConsoleCtrlEvent fails on Wine's terminal console, so the event
-// goes the way the console itself sends it: kernelbase's CtrlRoutine, which
-// lies at the same address in every process, run on a thread in the parent.
+// goes the way the console itself sends it, to torvad and to us: kernelbase's
+// CtrlRoutine, which lies at the same address in every process, run on a
+// thread in each. The handlers of Ctrl-Break and logoff return, and are
+// waited for; those of the close and the shutdown hold their threads.
 bool console_event(int n) {
     auto routine = reinterpret_cast<LPTHREAD_START_ROUTINE>(
         reinterpret_cast<void*>(GetProcAddress(GetModuleHandleA("kernelbase"), "CtrlRoutine")));
+    auto event = reinterpret_cast<void*>(static_cast<INT_PTR>(n));
     HANDLE parent = OpenProcess(PROCESS_ALL_ACCESS, FALSE, parent_id());
-    HANDLE thread =
-        routine == nullptr || parent == nullptr
-            ? nullptr
-            : CreateRemoteThread(parent, nullptr, 0, routine,
-                                 reinterpret_cast<void*>(static_cast<INT_PTR>(n)), 0, nullptr);
+    HANDLE threads[2] = {routine == nullptr || parent == nullptr
+                             ? nullptr
+                             : CreateRemoteThread(parent, nullptr, 0, routine, event, 0, nullptr),
+                         routine == nullptr ? nullptr
+                                            : CreateThread(nullptr, 0, routine, event, 0, nullptr)};
     if (parent != nullptr)
         CloseHandle(parent);
-    return thread != nullptr && CloseHandle(thread);
+    if (threads[0] == nullptr || threads[1] == nullptr)
+        return false;
+    bool returns = n == CTRL_BREAK_EVENT || n == CTRL_LOGOFF_EVENT;
+    return !returns || WaitForMultipleObjects(2, threads, TRUE, 10000) == WAIT_OBJECT_0;
 }
 
 // A named pipe: torvad reads it overlapped, which an anonymous pipe can't be.
