@@ -13,12 +13,9 @@ void prepare_streams();
 std::vector<std::string> start_state(int ipc_fd);
 // Leaves count orphans behind that report who adopted them and end when we do.
 bool leave_orphans(int count);
-// Takes first the names of the parent's pipes that its n-th random numbers
-// make, for each n of "n,n,...", as another program could; the bcrypt.dll
-// stand-in beside torvad makes the n-th call's bytes all n. Then whether
-// anybody connected to one of them.
-bool take_pipe_names(const std::string& calls);
-bool taken_pipe_connected();
+// Takes first the parent's pipe names of its random calls "n,n,...", which a
+// bcrypt.dll stand-in makes known; then, with "", whether any was connected.
+bool squat(const std::string& calls);
 // Console control event n (1 Ctrl-Break, 2 close, 5 logoff, 6 shutdown) to our
 // parent and to us, as the console sends it.
 bool console_event(int n);

@@ -2,6 +2,7 @@
 
 #include <tlhelp32.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
@@ -46,54 +47,39 @@ static DWORD parent_id() {
     return parent;
 }
 
-// Left open until we end, as a squatter would hold them; they never wait,
-// so that a look at them tells whether anybody connected.
-std::vector<HANDLE> taken_pipes;
-
-bool take_pipe_names(const std::string& calls) {
+// Left open until we end, as a squatter would hold them; never waiting.
+bool squat(const std::string& calls) {
+    static std::vector<HANDLE> taken;
     std::istringstream list(calls);
     for (std::string call; std::getline(list, call, ',');) {
-        char byte[3];
-        std::snprintf(byte, sizeof byte, "%02x", std::atoi(call.c_str()) & 0xff);
-        std::string name = "\\\\.\\pipe\\torvad_";
+        char name[64] = "\\\\.\\pipe\\torvad_";
         for (int i = 0; i < 16; ++i)
-            name += byte;
-        HANDLE pipe =
-            CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX, PIPE_TYPE_BYTE | PIPE_NOWAIT,
-                             PIPE_UNLIMITED_INSTANCES, 4096, 4096, 0, nullptr);
-        if (pipe == INVALID_HANDLE_VALUE)
-            return false;
-        taken_pipes.push_back(pipe);
+            std::snprintf(name + 16 + 2 * i, 3, "%02x", std::atoi(call.c_str()));
+        taken.push_back(CreateNamedPipeA(name, PIPE_ACCESS_DUPLEX, PIPE_NOWAIT, 9, 64, 64, 0, 0));
     }
-    return !taken_pipes.empty();
-}
-
-bool taken_pipe_connected() {
-    for (HANDLE pipe : taken_pipes)
-        if (!ConnectNamedPipe(pipe, nullptr) && GetLastError() != ERROR_PIPE_LISTENING)
+    if (!calls.empty())
+        return std::ranges::count(taken, INVALID_HANDLE_VALUE) == 0;
+    for (HANDLE pipe : taken)
+        if (ConnectNamedPipe(pipe, nullptr) || GetLastError() != ERROR_PIPE_LISTENING)
             return true;
     return false;
 }
 
-// GenerateConsoleCtrlEvent fails on Wine's terminal console, so the event
-// goes the way the console itself sends it, to torvad and to us: kernelbase's
-// CtrlRoutine, which lies at the same address in every process, run on a
-// thread in each. The handlers of Ctrl-Break and logoff return, and are
-// waited for; those of the close and the shutdown hold their threads.
+// As the console sends it (Wine's GenerateConsoleCtrlEvent fails): kernelbase's
+// CtrlRoutine, at the same address in every process, on a thread in torvad and
+// in us; waited for where the handlers return (Ctrl-Break, logoff).
 bool console_event(int n) {
     auto routine = reinterpret_cast<LPTHREAD_START_ROUTINE>(
         reinterpret_cast<void*>(GetProcAddress(GetModuleHandleA("kernelbase"), "CtrlRoutine")));
-    auto event = reinterpret_cast<void*>(static_cast<INT_PTR>(n));
-    HANDLE parent = OpenProcess(PROCESS_ALL_ACCESS, FALSE, parent_id());
-    HANDLE threads[2] = {routine == nullptr || parent == nullptr
-                             ? nullptr
-                             : CreateRemoteThread(parent, nullptr, 0, routine, event, 0, nullptr),
-                         routine == nullptr ? nullptr
-                                            : CreateThread(nullptr, 0, routine, event, 0, nullptr)};
-    if (parent != nullptr)
-        CloseHandle(parent);
-    if (threads[0] == nullptr || threads[1] == nullptr)
-        return false;
+    HANDLE threads[2] = {};
+    for (HANDLE& thread : threads) {
+        HANDLE process = &thread == threads ? OpenProcess(PROCESS_ALL_ACCESS, FALSE, parent_id())
+                                            : GetCurrentProcess();
+        thread = CreateRemoteThread(process, nullptr, 0, routine,
+                                    reinterpret_cast<void*>(static_cast<INT_PTR>(n)), 0, nullptr);
+        if (thread == nullptr)
+            return false;
+    }
     bool returns = n == CTRL_BREAK_EVENT || n == CTRL_LOGOFF_EVENT;
     return !returns || WaitForMultipleObjects(2, threads, TRUE, 10000) == WAIT_OBJECT_0;
 }

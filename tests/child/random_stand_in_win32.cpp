@@ -1,16 +1,12 @@
-// Stands in for bcrypt.dll beside a copy of torvad.exe, so that a test knows
-// the names of torvad's pipes before they are made, as a squatter would have
-// to: the n-th call fills its buffer with the byte n.
+// bcrypt.dll beside a copy of torvad.exe, which makes its pipe names known to a
+// test's squatter: the n-th call fills its buffer with the byte n.
 #include <windows.h>
 
 #include <cstring>
 
-namespace {
-unsigned char calls = 0;
-}
-
 extern "C" __declspec(dllexport) LONG WINAPI
     BCryptGenRandom(void*, unsigned char* buffer, ULONG size, ULONG) {
+    static unsigned char calls = 0;
     std::memset(buffer, calls++, size);
     return 0;
 }

@@ -110,12 +110,11 @@ int mode_execute(const context& how) {
             std::error_code error;
             say(fs::remove(fs::current_path(), error) ? "rmcwd 0" : "rmcwd -1");
         } else if (end - at > 1) {
-            std::string items = join_strings({how.args.begin() + at + 1, how.args.begin() + end});
-            // Flags ending in 'x': each \xHH in the items is that byte.
-            for (std::size_t x = 0; how.args[at].ends_with('x') && x + 3 < items.size(); ++x)
-                if (items.compare(x, 2, "\\x") == 0)
-                    items.replace(
-                        x, 4, 1, static_cast<char>(std::stoi(items.substr(x + 2, 2), nullptr, 16)));
+            std::vector<std::string> list(how.args.begin() + at + 1, how.args.begin() + end);
+            if (how.args[at].ends_with('x')) // flags "Nx": the last item is one byte, in hex
+                list.back() =
+                    std::string(1, static_cast<char>(std::stoi(list.back(), nullptr, 16)));
+            std::string items = join_strings(list);
             auto block = encode_packet(++channel, packet_execute, std::stoul(how.args[at]),
                                        items.data(), items.size());
             batch.append(block.begin(), block.end());
@@ -206,13 +205,11 @@ int main(int argc, char** argv) {
         return serve(how);
     if (mode == "orphans")
         return child_host::leave_orphans(how.number(0)) ? (say("orphans made"), 3) : 1;
-    // "squat N,N,... ...": takes the names of torvad's pipes N, then executes
-    // the rest; says at the end whether anybody connected to them.
+    // "squat N,N,... ...": takes torvad's pipe names N, executes the rest, tells if heard.
     if (mode == "squat") {
-        say(child_host::take_pipe_names(how.args.at(0)) ? "squat taken" : "squat failed");
+        say(child_host::squat(how.args.at(0)) ? "squat taken" : "squat failed");
         int code = mode_execute({{how.args.begin() + 1, how.args.end()}, how.ipc_fd});
-        return say(child_host::taken_pipe_connected() ? "squat connected" : "squat heard nothing"),
-               code;
+        return say(child_host::squat("") ? "squat connected" : "squat heard nothing"), code;
     }
     // "attach TORVAD CHILD": starts TORVAD with -a on a pipe of ours and has it
     // run CHILD forging on that pipe's far end, with pipes, so that handles pass.

@@ -99,44 +99,29 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     run_wine({"sc", "delete", name});
 }
 
-// What the permission rules promise on Windows beyond Linux: items whole on a
-// double-byte code page (Japanese, 932, from a locale of the test's own) or
-// refused when they are no text there; and pipe names a child can't take
-// first: a copy of torvad with a bcrypt.dll stand-in makes them known, and a
-// squatter on each of the four pipes of a launch only makes torvad take
-// another name, while one on every name tried fails that launch.
+// Items whole on code page 932 (a locale of the test's own), or refused; squatters on
+// each pipe of a launch (torvad's names known through a bcrypt.dll stand-in).
 TEST(windows, items_and_pipes_stay_the_requesters) {
     if (!under_wine)
         GTEST_SKIP() << "the Windows build under Wine";
-    scratch_dir locales, known;
-    ASSERT_EQ(std::system(("localedef -i ja_JP -f UTF-8 " + locales.path + "/ja_JP.UTF-8").c_str()),
-              0);
-    std::string build = std::filesystem::path(child_file).parent_path().parent_path();
-    for (const char* file : {"/torvad.exe", "/stand_in/bcrypt.dll"})
-        std::filesystem::copy(build + file, known.path);
-    options japanese{.env = {"LOCPATH=" + locales.path, "LC_ALL=ja_JP.UTF-8"}},
-        named{.env = {"WINEDLLOVERRIDES=mscoree,mshtml=;bcrypt=n"},
-              .program = known.path + "/torvad.exe"};
-    auto squat = [](const char* calls) {
-        return std::vector<std::string>{"-v",  "--", child_binary, "squat",
-                                        calls, "3",  child_binary, "peer"};
-    };
+    scratch_dir ja, known;
+    ASSERT_EQ(std::system(("localedef -i ja_JP -f UTF-8 " + ja.path + "/ja_JP.UTF-8").c_str()), 0);
+    for (const char* file : {"../torvad.exe", "../stand_in/bcrypt.dll"})
+        std::filesystem::copy(std::filesystem::path(child_file).parent_path() / file, known.path);
     run_rows({
-        // U+2015 and U+8868 end in the byte of a backslash on code page 932; a
-        // lone lead byte (the 'x' in the flags has the child send \xHH as a byte)
+        // U+2015 and U+8868 end in a backslash's byte there; a lone 0x81 is no text
         {child({"execute", "2", child_binary, "args", "\u2015\" --delete-all", "C:\\\u8868\\",
-                "next", "+", "2x", child_binary, "args", "\\x81"}),
+                "next", "+", "2x", child_binary, "args", "81"}),
          {"&child: 1 stdout child: args [\\x81\\\" --delete-all][C:\\\\x95\\\\][next]\n",
           "&refused to run '" + child_binary + "': an item is no text of the system's code page.",
           "&child: 2 failed 1113", "!INT", "=0"},
-         japanese},
-        {squat("1,3,5,7"),
-         {"?child: squat taken", "&child: 1 opened", "&child: 1 stdout child: version", "!INT",
-          "?child: squat heard nothing", "=0"},
-         named},
-        {squat("1,2,3,4"),
-         {"?child: squat taken", "?its name taken by another program", "?child: 1 failed 5", "!INT",
-          "?child: squat heard nothing", "=0", "-child: 1 opened"},
-         named},
+         {.env = {"LOCPATH=" + ja.path, "LC_ALL=ja_JP.UTF-8"}}},
+        // the first request's four pipes each find a name taken once, the second's stdin four times
+        {{"-v", "--", child_binary, "squat", "1,3,5,7,9,10,11,12", "3", child_binary, "peer", "+",
+          "3", child_binary, "peer"},
+         {"?child: squat taken", "&child: 1 stdout child: version", "&its name taken by another",
+          "&child: 2 failed 5", "!INT", "?child: squat heard nothing", "=0", "-child: 2 opened"},
+         {.env = {"WINEDLLOVERRIDES=mscoree,mshtml=;bcrypt=n"},
+          .program = known.path + "/torvad.exe"}},
     });
 }
