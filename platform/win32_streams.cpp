@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <memory>
+#include <utility>
 
 #include <boost/asio/buffer.hpp>
 #include <boost/asio/error.hpp>
@@ -72,6 +73,7 @@ os_error bind(stream& ours, owned_handle& handle) {
 
 const char* const name_taken = "CreateNamedPipeA, its name taken by another program";
 const char* const connected_elsewhere = "CreateFileA, connected to another program's pipe";
+int taken_names = 0; // since taken_pipe_names last told them
 
 // One instance of the pipe name, ours bound to the loop, theirs opened on it,
 // which connects the pipe. Each pipe is made ours alone rather than left open
@@ -140,6 +142,7 @@ os_error make_pipe(DWORD open_mode, DWORD pipe_mode, DWORD buffer_size, stream& 
                                 their_flags, theirs, failed);
         if (error.call != name_taken && error.call != connected_elsewhere)
             return error;
+        ++taken_names;
         boost::system::error_code ignored;
         ours.close(ignored);
     }
@@ -164,6 +167,10 @@ os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) 
     if (failed == pipe_step::open)
         ours.close(ignored);
     return error;
+}
+
+int taken_pipe_names() {
+    return std::exchange(taken_names, 0);
 }
 
 os_error attach_pipe(stream& ours, std::int64_t value) {

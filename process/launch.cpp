@@ -4,7 +4,20 @@
 
 namespace torvad {
 
+namespace {
+
+// Somebody tries to take our pipes: the launch went on under fresh names, or
+// failed once none was left to try, and the operator is to know either way.
+void report_taken_names(process_owner& owner) {
+    if (int taken = platform::taken_pipe_names())
+        owner.log_warning("another program took %d pipe names first; fresh names were tried.",
+                          taken);
+}
+
+} // namespace
+
 bool process::fail_launch(std::uint32_t failure_status, const platform::os_error& error) {
+    report_taken_names(owner);
     if (error)
         owner.log_verbose("%s", platform::describe(error).c_str());
     finish(failure_status, packet_failed);
@@ -66,6 +79,7 @@ bool process::start() {
     // At a console the terminal signals its whole foreground group; only
     // we are to hear Ctrl-C, and stop the children in order.
     request.own_process_group = !owner.facts().background;
+    report_taken_names(owner);
     platform::launch_result launched = platform::launch_child(request);
     // The child has its copies of these now, or never will.
     child_ipc.reset();
