@@ -16,8 +16,7 @@ bool leave_orphans(int count);
 // Takes first the parent's pipe names of its random calls "n,n,...", which a
 // bcrypt.dll stand-in makes known; then, with "", whether any was connected.
 bool squat(const std::string& calls);
-// Console control event n (1 Ctrl-Break, 2 close, 5 logoff, 6 shutdown) to our
-// parent and to us, as the console sends it.
+// Console event n (1 Ctrl-Break, 2 close, 5 logoff, 6 shutdown) to our parent and to us.
 bool console_event(int n);
 // Makes a pipe and starts torvad with -a on its far end (theirs).
 bool start_attached(const std::string& torvad, int& ours, long& theirs);

@@ -112,8 +112,7 @@ int mode_execute(const context& how) {
         } else if (end - at > 1) {
             std::vector<std::string> list(how.args.begin() + at + 1, how.args.begin() + end);
             if (how.args[at].ends_with('x')) // flags "Nx": the last item is one byte, in hex
-                list.back() =
-                    std::string(1, static_cast<char>(std::stoi(list.back(), nullptr, 16)));
+                list.back() = std::string(1, char(std::stoi(list.back(), nullptr, 16)));
             std::string items = join_strings(list);
             auto block = encode_packet(++channel, packet_execute, std::stoul(how.args[at]),
                                        items.data(), items.size());
@@ -226,9 +225,7 @@ int main(int argc, char** argv) {
         return say(forged ? "attach forged" : "attach clean"), 0;
     }
     // A logoff is no stop: once it has passed, the child ends of its own accord.
-    if (mode == "console-event" && !child_host::console_event(how.number(0)))
-        return 1;
-    if (mode == "console-event")
+    if (mode == "console-event" && child_host::console_event(how.number(0)))
         return how.number(0) == 5 ? (say("logoff passed"), 0) : serve(how);
     std::fprintf(stderr, "usage: test_child <mode> [args...] [ipc fd]\n");
     return 64;

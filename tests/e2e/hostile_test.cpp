@@ -53,8 +53,7 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "z", "!INT",
           "?'test_child' exited with 0x0.", "=0"},
          {.shell = "trap '' CHLD", .where = systems::linux_only}},
-        // Ctrl-Break, the console's close and the shutdown, reaching torvad and a peer
-        // child alike, stop the children the same way; a logoff stops nothing
+        // Ctrl-Break, close and shutdown at torvad and a peer alike stop in order; logoff not
         {child({"console-event", "1"}), ordered_stop, on_windows},
         {child({"console-event", "2"}), ordered_stop, on_windows},
         {child({"console-event", "6"}), ordered_stop, on_windows},
