@@ -129,10 +129,12 @@ os_error make_pipe_named(const std::string& name, DWORD open_mode, DWORD pipe_mo
 // A name found taken is tried again under a fresh one, so that a squatter
 // who guessed a name can't keep a launch from succeeding; with random names
 // a second guess is as unlikely as the first, and a few tries are plenty.
+constexpr int name_tries = 4;
+
 os_error make_pipe(DWORD open_mode, DWORD pipe_mode, DWORD buffer_size, stream& ours,
                    DWORD their_access, DWORD their_flags, owned_handle& theirs, pipe_step& failed) {
     os_error error;
-    for (int attempt = 0; attempt < 4; ++attempt) {
+    for (int attempt = 0; attempt < name_tries; ++attempt) {
         std::string name;
         if ((error = random_pipe_name(name))) {
             failed = pipe_step::create;
