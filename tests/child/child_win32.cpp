@@ -47,7 +47,8 @@ static DWORD parent_id() {
     return parent;
 }
 
-// Left open until we end, as a squatter would hold them; never waiting.
+// Left open until we end, as a squatter would hold them; then whether any
+// was connected (a look at a pipe that nobody opened fails, listening).
 bool squat(const std::string& calls) {
     static std::vector<HANDLE> taken;
     std::istringstream list(calls);
@@ -55,12 +56,13 @@ bool squat(const std::string& calls) {
         char name[64] = "\\\\.\\pipe\\torvad_";
         for (int i = 0; i < 16; ++i)
             std::snprintf(name + 16 + 2 * i, 3, "%02x", std::atoi(call.c_str()));
-        taken.push_back(CreateNamedPipeA(name, PIPE_ACCESS_DUPLEX, PIPE_NOWAIT, 9, 64, 64, 0, 0));
+        taken.push_back(CreateNamedPipeA(name, PIPE_ACCESS_DUPLEX, 0, 9, 64, 64, 0, nullptr));
     }
     if (!calls.empty())
         return std::ranges::count(taken, INVALID_HANDLE_VALUE) == 0;
     for (HANDLE pipe : taken)
-        if (ConnectNamedPipe(pipe, nullptr) || GetLastError() != ERROR_PIPE_LISTENING)
+        if (PeekNamedPipe(pipe, nullptr, 0, nullptr, nullptr, nullptr) ||
+            GetLastError() == ERROR_BROKEN_PIPE)
             return true;
     return false;
 }
