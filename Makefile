@@ -1,12 +1,13 @@
 # The two commands of the README, and the steps they are made of.
 PACKAGES := libboost1.81-dev libboost-filesystem1.81-dev libgtest-dev \
             libgmock-dev libbenchmark-dev cmake ninja-build g++ clang libclang-rt-14-dev \
-            clang-format
+            clang-format redis-server python3
 FUZZ_SECONDS ?= 30
 # The version, which CMakeLists.txt names once.
 VERSION := $(shell sed -n '/^project/s/.* VERSION \([0-9.]*\).*/\1/p' CMakeLists.txt)
 
-.PHONY: all deps build run package test test-asan test-system fuzz bench format format-check clean \
+.PHONY: all deps build run package test test-asan test-system fuzz matcher-equality bench format \
+        format-check clean \
         windows windows-deps test-windows container-deps image test-container
 
 all: build
@@ -23,11 +24,15 @@ build: deps build/build.ninja
 	cmake --build build
 
 # The demo product in examples/demo: core is found there, the init script runs
-# through the stand-in interpreter, and core fails once so its restart shows.
+# through the stand-in interpreter, core fails once so its restart shows, and
+# the product is ready (-r) once the second core says so.
+# DEMO_CORE=examples/demo_core.py runs the core written in Python instead.
+DEMO_CORE ?= build/demo_core
 run: build
-	cp build/demo_core examples/demo/core
+	cp $(DEMO_CORE) examples/demo/core
 	rm -f examples/demo/failed-once.marker
-	PATH="$(CURDIR)/examples/demo/bin:$$PATH" ./build/torvad -v -d examples/demo
+	PYTHONPATH="$(CURDIR)/peer/python" PATH="$(CURDIR)/examples/demo/bin:$$PATH" \
+	  ./build/torvad -v -r -d examples/demo
 
 # A Debian package of what `cmake --install` puts in place.
 package: build
@@ -50,8 +55,8 @@ test: build
 # throw-away overlay of / (never on the machine's own /: its tmpfiles step
 # would empty /tmp). Needs root; about a minute.
 test-system: package
-	@dpkg -s systemd util-linux >/dev/null 2>&1 || { apt-get update && \
-	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux; }
+	@dpkg -s systemd util-linux redis-server >/dev/null 2>&1 || { apt-get update && \
+	  DEBIAN_FRONTEND=noninteractive apt-get install -y systemd util-linux redis-server; }
 	tests/system/run.sh build/torvad_$(VERSION)_amd64.deb build/demo_core
 
 # --- The OCI image: torvad and the demo product, FROM scratch, offline -------
@@ -106,6 +111,13 @@ fuzz: deps build-fuzz/build.ninja
 	  ./build-fuzz/fuzz/fuzz_$(target) -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
 	    $(FUZZ_FLAGS_$(target)) -artifact_prefix=build-fuzz/$(target)- \
 	    build-fuzz/corpus_$(target) fuzz/seeds_$(target) && ) true
+
+# The parser's automata against libstdc++ 12's own compiler, node for node, over
+# the regex fuzzer's dictionary, seeds and grown corpus; builds only where the
+# fuzz build's library is libstdc++ 12. Not part of `make test`.
+matcher-equality: deps build-fuzz/build.ninja
+	cmake --build build-fuzz --target matcher_equality
+	./build-fuzz/fuzz/matcher_equality fuzz/regex.dict fuzz/seeds_regex build-fuzz/corpus_regex
 
 bench: build
 	./build/bench/bench_framing

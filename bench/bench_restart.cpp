@@ -1,11 +1,12 @@
 // Restart latency: from a failing child's exit to its successor's start,
-// median over 1000 restarts under torvad, against a bare loop that waits on a
-// pidfd and spawns the same child at once. The two take turns, one restart
-// each, so that both see the same load: each child records its start, says
-// it is ready and waits until the bench lets it exit (two FIFOs, the gate),
-// and the bench lets the next one go only once the last one's successor has
-// said it is ready.
-//   bench_restart [path of torvad]
+// median over 1000 restarts under torvad, under torvad through torvad-wrap,
+// and in a bare loop that waits on a pidfd and spawns the same child at once.
+// The three take turns, one restart each, so that all see the same load: each
+// child records its start, says it is ready and waits until the bench lets it
+// exit (two FIFOs, the gate), and the bench lets the next one go only once
+// the last one's successor has said it is ready. Before the end it reads what
+// the wrapper holds in memory, against torvad's own.
+//   bench_restart [path of torvad [path of torvad-wrap]]
 #include <algorithm>
 #include <atomic>
 #include <csignal>
@@ -158,8 +159,9 @@ struct scratch {
             dir = pattern;
     }
     ~scratch() {
-        for (const char* name : {"torvad.log", "bare.log", "torvad.gate.ready", "torvad.gate.go",
-                                 "bare.gate.ready", "bare.gate.go"})
+        for (const char* name :
+             {"torvad.log", "wrap.log", "bare.log", "torvad.gate.ready", "torvad.gate.go",
+              "wrap.gate.ready", "wrap.gate.go", "bare.gate.ready", "bare.gate.go"})
             unlink(file(name).c_str());
         if (!dir.empty())
             rmdir(dir.c_str());
@@ -168,21 +170,89 @@ struct scratch {
     bool made() const { return !dir.empty(); }
 };
 
-// Takes the turns; false when a child or torvad failed on the way.
-bool take_turns(gate& supervised, gate& bare_gate, bare_loop& bare) {
-    if (!supervised.wait_for_child() || !bare.spawn() || !bare_gate.wait_for_child())
+// Takes the turns; false when a child or torvad failed on the way. Before
+// the children are let go, measure looks at them once more.
+template <class Measure>
+bool take_turns(gate (&supervised)[2], gate& bare_gate, bare_loop& bare, Measure measure) {
+    for (gate& side : supervised)
+        if (!side.wait_for_child())
+            return false;
+    if (!bare.spawn() || !bare_gate.wait_for_child())
         return false;
     for (int i = 0; i < restarts; ++i) {
         // torvad sees the exit and starts the successor, which comes to the gate.
-        if (!supervised.release(restart_again) || !supervised.wait_for_child())
-            return false;
+        for (gate& side : supervised)
+            if (!side.release(restart_again) || !side.wait_for_child())
+                return false;
         if (!bare_gate.release(restart_again) || bare.reap() != 1 || !bare.spawn() ||
             !bare_gate.wait_for_child())
             return false;
     }
-    bool ended = supervised.release(end_clean) && bare_gate.release(end_clean);
+    measure();
+    bool ended = supervised[0].release(end_clean) && supervised[1].release(end_clean) &&
+                 bare_gate.release(end_clean);
     return bare.reap() == 0 && ended;
 }
+
+// The kB of a process's memory that it alone holds (private pages), and its
+// proportional share of the rest too (Pss), from the kernel's summary.
+std::pair<long, long> own_memory_kb(pid_t pid) {
+    std::FILE* rollup = std::fopen(("/proc/" + std::to_string(pid) + "/smaps_rollup").c_str(), "r");
+    long alone = 0, share = 0, kb = 0;
+    char line[256], name[64];
+    while (rollup && std::fgets(line, sizeof line, rollup)) {
+        if (std::sscanf(line, "%63s %ld kB", name, &kb) != 2)
+            continue;
+        std::string field = name;
+        alone += field == "Private_Clean:" || field == "Private_Dirty:" ? kb : 0;
+        share = field == "Pss:" ? kb : share;
+    }
+    if (rollup)
+        std::fclose(rollup);
+    return {alone, share};
+}
+
+// The first child of pid: under the wrapped torvad, the wrapper.
+pid_t first_child(pid_t pid) {
+    std::string path =
+        "/proc/" + std::to_string(pid) + "/task/" + std::to_string(pid) + "/children";
+    std::FILE* list = std::fopen(path.c_str(), "r");
+    int child = -1;
+    if (list && std::fscanf(list, "%d", &child) != 1)
+        child = -1;
+    if (list)
+        std::fclose(list);
+    return child;
+}
+
+// torvad at a pseudo-terminal, so that it runs in the foreground, with its
+// console drained on a thread of its own.
+struct console_run {
+    pid_t pid = -1;
+    int terminal = -1;
+    std::atomic<bool> ended{false};
+    std::thread drain;
+
+    bool start(std::vector<const char*> argv) {
+        pid = forkpty(&terminal, nullptr, nullptr, nullptr);
+        if (pid == 0) {
+            argv.push_back(nullptr);
+            execv(argv[0], const_cast<char**>(argv.data()));
+            _exit(127);
+        }
+        if (pid != -1)
+            drain = std::thread(drain_console, terminal, pid, std::ref(ended));
+        return pid != -1;
+    }
+    // True when torvad ended by itself with status 0.
+    bool finish() {
+        drain.join();
+        int status = 0;
+        waitpid(pid, &status, 0);
+        close(terminal);
+        return ended && WIFEXITED(status) && WEXITSTATUS(status) == 0;
+    }
+};
 
 } // namespace
 
@@ -190,53 +260,59 @@ int main(int argc, char** argv) {
     if (argc >= 4 && std::strcmp(argv[1], "child") == 0)
         return run_child(argv[2], argv[3]);
     const char* torvad = argc > 1 ? argv[1] : "./build/torvad";
+    const char* wrap = argc > 2 ? argv[2] : "./build/torvad-wrap";
     char self[4096];
     ssize_t length = readlink("/proc/self/exe", self, sizeof self - 1);
     scratch files;
-    if (length <= 0 || access(torvad, X_OK) != 0 || !files.made()) {
-        std::fprintf(stderr, "usage: %s [path of torvad]\n", argv[0]);
+    if (length <= 0 || access(torvad, X_OK) != 0 || access(wrap, X_OK) != 0 || !files.made()) {
+        std::fprintf(stderr, "usage: %s [path of torvad [path of torvad-wrap]]\n", argv[0]);
         return 1;
     }
     self[length] = '\0';
-    std::string torvad_log = files.file("torvad.log"), bare_log = files.file("bare.log");
-    gate supervised{files.file("torvad.gate")}, bare_gate{files.file("bare.gate")};
-    if (!supervised.open_fifos() || !bare_gate.open_fifos())
+    std::string logs[] = {files.file("torvad.log"), files.file("wrap.log"), files.file("bare.log")};
+    gate supervised[] = {{files.file("torvad.gate")}, {files.file("wrap.gate")}};
+    gate bare_gate{files.file("bare.gate")};
+    if (!supervised[0].open_fifos() || !supervised[1].open_fifos() || !bare_gate.open_fifos())
         return 1;
-    // torvad at a pseudo-terminal, so that it runs in the foreground.
-    int terminal = -1;
-    pid_t pid = forkpty(&terminal, nullptr, nullptr, nullptr);
-    if (pid == -1)
+    char wrap_path[4096];
+    if (realpath(wrap, wrap_path) == nullptr)
         return 1;
-    if (pid == 0) {
-        execl(torvad, torvad, "--", self, "child", torvad_log.c_str(), supervised.path.c_str(),
-              nullptr);
-        _exit(127);
-    }
-    std::atomic<bool> console_ended{false};
-    std::thread console(drain_console, terminal, pid, std::ref(console_ended));
+    console_run plain, wrapped;
+    if (!plain.start({torvad, "--", self, "child", logs[0].c_str(), supervised[0].path.c_str()}) ||
+        !wrapped.start(
+            {torvad, "--", wrap_path, self, "child", logs[1].c_str(), supervised[1].path.c_str()}))
+        return 1;
     bare_loop bare{
-        {self, const_cast<char*>("child"), bare_log.data(), bare_gate.path.data(), nullptr}};
-    bool turns_ok = take_turns(supervised, bare_gate, bare);
+        {self, const_cast<char*>("child"), logs[2].data(), bare_gate.path.data(), nullptr}};
+    std::pair<long, long> wrapper_kb, torvad_kb;
+    bool turns_ok = take_turns(supervised, bare_gate, bare, [&] {
+        wrapper_kb = own_memory_kb(first_child(wrapped.pid));
+        torvad_kb = own_memory_kb(wrapped.pid);
+    });
     // A child that failed on the way leaves torvad waiting for nothing.
     if (!turns_ok)
-        kill(-pid, SIGKILL);
-    console.join();
-    int status = 0;
-    waitpid(pid, &status, 0);
-    close(terminal);
-    auto under_torvad = restart_gaps_us(torvad_log), in_bare_loop = restart_gaps_us(bare_log);
-    bool torvad_ok = console_ended && WIFEXITED(status) && WEXITSTATUS(status) == 0;
-    if (!turns_ok || !torvad_ok || under_torvad.size() != restarts ||
-        in_bare_loop.size() != restarts) {
+        kill(-plain.pid, SIGKILL), kill(-wrapped.pid, SIGKILL);
+    bool torvads_ok = plain.finish() && wrapped.finish();
+    std::vector<double> gaps[3];
+    for (int side = 0; side < 3; ++side)
+        gaps[side] = restart_gaps_us(logs[side]);
+    if (!turns_ok || !torvads_ok || gaps[0].size() != restarts || gaps[1].size() != restarts ||
+        gaps[2].size() != restarts) {
         std::fprintf(stderr,
-                     "incomplete run: %zu restarts under torvad (status 0x%x), %zu in the "
-                     "bare loop\n",
-                     under_torvad.size(), status, in_bare_loop.size());
+                     "incomplete run: %zu restarts under torvad, %zu through torvad-wrap, %zu in "
+                     "the bare loop\n",
+                     gaps[0].size(), gaps[1].size(), gaps[2].size());
         return 1;
     }
-    double ours = median(under_torvad), baseline = median(in_bare_loop);
+    double ours = median(gaps[0]), through_wrap = median(gaps[1]), baseline = median(gaps[2]);
     std::printf("restart latency median over %d, taking turns: torvad %.0f us, bare loop %.0f us, "
                 "ratio %.2f\n",
                 restarts, ours, baseline, ours / baseline);
+    std::printf("through torvad-wrap: %.0f us, ratio %.2f to the bare restart under torvad\n",
+                through_wrap, through_wrap / ours);
+    std::printf("torvad-wrap's own memory: %ld kB private, %ld kB proportional (Pss); torvad's: "
+                "%ld kB, %ld kB; ratio %.2f\n",
+                wrapper_kb.first, wrapper_kb.second, torvad_kb.first, torvad_kb.second,
+                double(wrapper_kb.first) / double(torvad_kb.first));
     return 0;
 }

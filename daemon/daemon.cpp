@@ -47,8 +47,6 @@ void daemon::load_patterns(const char* path) {
     }
     for (const auto& skipped : file.skipped)
         log_error("%s", describe_skipped(skipped, path).c_str());
-    if (!file.stack_failure.empty())
-        log_error("%s", file.stack_failure.c_str());
 }
 
 void daemon::add_stop_signal(int signal_number) {
@@ -183,6 +181,7 @@ void daemon::remove(const std::shared_ptr<process>& child) {
     // Each process knows its channels: an end costs the same however many
     // children there are.
     child->close_channel_pipes();
+    ready_children_.erase(child.get());
     if (children_.erase(child) != 0 && child->persistent) {
         --persistent_children_;
         persistent_children_changed();
@@ -207,6 +206,21 @@ void daemon::child_ended(const process& child, std::uint32_t status) {
     // never looks empty across a restart.
     if (again)
         process::create(*this, child.request(), child.place())->start();
+}
+
+// A successor starts unready, but the product was ready once and stays so:
+// those who waited for it have acted on it already.
+void daemon::child_ready(const process& child) {
+    if (!settings_.readiness || !child.persistent || product_ready_)
+        return;
+    ready_children_.insert(&child);
+    if (ready_children_.size() < persistent_children_)
+        return;
+    product_ready_ = true;
+    ready_children_.clear();
+    log_info("the product is ready.");
+    if (on_ready_)
+        on_ready_();
 }
 
 } // namespace torvad

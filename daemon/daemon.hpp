@@ -5,6 +5,7 @@
 // of its members goes.
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <string>
 #include <unordered_set>
@@ -26,6 +27,7 @@ struct settings {
     bool logging = false;     // -l: every line also goes to the event log
     bool background = false;  // the service path: stdout is not a terminal, or -b
     bool auto_restart = true; // cleared by -o; any stop clears it for good
+    bool readiness = false;   // -r: ready only once every persistent child says so
 };
 
 class daemon final : public process_owner {
@@ -75,12 +77,17 @@ class daemon final : public process_owner {
     void take_orphans();
     void set_program_name(std::string name) { facts_.program_name = std::move(name); }
     const std::string& service_name() const { return service_name_; }
+    // With -r, report runs once, on the loop, when every persistent child
+    // started has said it is ready; a restart doesn't withdraw that.
+    bool awaits_readiness() const { return settings_.readiness; }
+    void when_ready(std::function<void()> report) { on_ready_ = std::move(report); }
 
     // What a process needs of its owner.
     boost::asio::io_context& loop() override { return loop_; }
     void adopt(std::shared_ptr<process> child) override;
     void remove(const std::shared_ptr<process>& child) override;
     void child_ended(const process& child, std::uint32_t status) override;
+    void child_ready(const process& child) override;
     const pattern_lists& patterns() const override { return patterns_; }
     const run_facts& facts() const override { return facts_; }
     void write_log(platform::event_type type, const char* text) override;
@@ -109,6 +116,10 @@ class daemon final : public process_owner {
     platform::stream orphan_watch_;
     pattern_lists patterns_;
     bool children_report_posted_ = false;
+    // The persistent children that said they are ready, until all of them have.
+    std::unordered_set<const process*> ready_children_;
+    bool product_ready_ = false;
+    std::function<void()> on_ready_;
     bool stop_requested_ = false;
     bool shut_down_ = false;
 };

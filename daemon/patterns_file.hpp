@@ -15,9 +15,6 @@ struct patterns_file {
     // which the log gives under -v; both empty when it was read.
     std::string open_failure, open_failure_reason;
     std::vector<skipped_line> skipped;
-    // The log's error when no stack for the compiler could be had: every
-    // line is skipped then.
-    std::string stack_failure;
 };
 
 patterns_file load_patterns_file(const std::string& path);

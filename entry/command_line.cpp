@@ -50,6 +50,9 @@ command_line scan_command_line(int argc, char** argv) {
         case 'o':
             options.no_restart = true;
             break;
+        case 'r':
+            options.readiness = true;
+            break;
         case 'f':
             take_string(argc, argv, i, options.family);
             break;
@@ -84,6 +87,7 @@ std::string help_text(const char* program) {
            "  -l  enable logging\n"
            "  -b  start service\n"
            "  -o  disable auto restart after failure\n"
+           "  -r  ready once all children say so\n"
            "  -f  <product family>\n"
            "  -u  <user>\n"
            "  -d  <directory>\n"

@@ -12,6 +12,7 @@ struct command_line {
     bool logging = false;
     bool background = false; // -b; main ors in "stdout is not a terminal"
     bool no_restart = false; // -o
+    bool readiness = false;  // -r
     std::string family = "torvaSentry";
     std::string user;
     std::string directory;

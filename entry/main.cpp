@@ -19,7 +19,8 @@ settings settings_of(const command_line& options) {
     return {.verbose = options.verbose,
             .logging = options.logging,
             .background = options.background || !platform::stdout_is_terminal(),
-            .auto_restart = !options.no_restart};
+            .auto_restart = !options.no_restart,
+            .readiness = options.readiness};
 }
 
 // The name is made absolute before the working directory changes, so that the

@@ -5,6 +5,8 @@
 #include <cstddef>
 #include <mutex>
 
+#include <boost/asio/steady_timer.hpp>
+
 #include "platform/platform.hpp"
 
 namespace torvad {
@@ -14,7 +16,7 @@ class daemon;
 class service_run {
   public:
     // The daemon must outlive the dispatcher's run.
-    explicit service_run(daemon& supervisor) : daemon_(supervisor) {}
+    explicit service_run(daemon& supervisor);
 
     // Reports start, runs the loop until a stop control or the last persistent
     // child's end, stops the children and gives them a second run to end in.
@@ -24,12 +26,15 @@ class service_run {
 
   private:
     void report(platform::service_state state, std::size_t children);
+    // Start pending goes on, with a new checkpoint each second, until ready.
+    void show_progress();
 
     daemon& daemon_;
     // A stop control ends the first run of the loop only: the second run is
     // the children's orderly end, and a repeated stop must not cut it short.
     std::mutex first_run_guard_;
     bool first_run_over_ = false;
+    boost::asio::steady_timer progress_;
 };
 
 } // namespace torvad

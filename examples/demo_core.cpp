@@ -2,7 +2,8 @@
 // examples/demo and supervises it. It shows what a product program does:
 // answer -h with its version (or torvad hands the service over to it), read
 // the supervisor's version, have tools run through execute under the rules of
-// exec.patterns, fail once so torvad starts it again, and end on sigterm.
+// exec.patterns, fail once so torvad starts it again, say it is ready, and
+// end on sigterm.
 #include <cstdio>
 #include <cstring>
 
@@ -92,6 +93,9 @@ int main(int argc, char** argv) {
         return 3;
     }
     ask_for_tools(link);
+    // Serving from here on: under -r torvad reports the product ready once
+    // every persistent child has said so; the failing first start never did.
+    link.send_ready();
     std::fflush(stdout);
     // 0 tells torvad this was an orderly end, not one to restart.
     return serve(link) ? 0 : 1;

@@ -88,7 +88,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         } catch (const std::regex_error&) {
         }
     };
-    if (!torvad::platform::run_on_large_stack(std::size_t{1} << 30, ask_library))
+    if (!fuzz::on_large_stack(ask_library))
         __builtin_trap();
     if (!library)
         return 0; // not a valid line, or std::regex gives no answer in time

@@ -4,12 +4,15 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <exception>
+#include <functional>
 #include <iterator>
 #include <optional>
+#include <pthread.h>
 #include <regex>
 #include <string>
 
-#include "matcher/automaton.hpp"
+#include "matcher/bounded_regex.hpp"
 
 namespace fuzz {
 
@@ -64,7 +67,8 @@ inline std::optional<bool> library_answer(const std::regex& expression, const st
 }
 
 // An input of the regex fuzzers: a pattern, a line feed, a text, each cut to
-// its most; null when the library's compiler would overflow a long on it.
+// its most; null when torvad refuses the pattern for a number too long, on
+// which the library's compiler may overflow a long.
 struct regex_input {
     std::string pattern, text;
 };
@@ -74,13 +78,47 @@ inline std::optional<regex_input> split_regex_input(const std::uint8_t* data, st
     std::size_t cut = input.find('\n');
     regex_input split{input.substr(0, std::min(cut, max_pattern)),
                       cut == std::string::npos ? "" : input.substr(cut + 1, max_text)};
-    if (torvad::regex::has_oversized_number(split.pattern))
+    std::string error;
+    if (!torvad::bounded_regex::compile(split.pattern, error) &&
+        error.find("number is too large") != std::string::npos)
         return std::nullopt;
     return split;
 }
 
 inline bool library_is_quick(const std::regex& expression, const std::string& text) {
     return library_answer(expression, text).has_value();
+}
+
+// The library's matcher recurses per step, up to the automaton's size even on
+// an empty text: work runs on a thread whose 1 GiB stack is only reserved.
+// What work throws is thrown here; false when no such thread could be had.
+inline bool on_large_stack(const std::function<void()>& work) {
+    struct task {
+        const std::function<void()>& work;
+        std::exception_ptr failure;
+    } job{work, nullptr};
+    auto run = [](void* argument) -> void* {
+        auto* running = static_cast<task*>(argument);
+        try {
+            running->work();
+        } catch (...) {
+            running->failure = std::current_exception();
+        }
+        return nullptr;
+    };
+    pthread_attr_t attributes;
+    pthread_t thread;
+    if (pthread_attr_init(&attributes) != 0)
+        return false;
+    bool started = pthread_attr_setstacksize(&attributes, std::size_t{1} << 30) == 0 &&
+                   pthread_create(&thread, &attributes, run, &job) == 0;
+    pthread_attr_destroy(&attributes);
+    if (!started)
+        return false;
+    pthread_join(thread, nullptr);
+    if (job.failure)
+        std::rethrow_exception(job.failure);
+    return true;
 }
 
 } // namespace fuzz

@@ -6,8 +6,8 @@
 namespace torvad {
 
 const char* packet_type_name(std::uint32_t type) {
-    static const char* const names[] = {"stdin",  "stdout",  "stderr",  "opened", "failed",
-                                        "closed", "execute", "version", "sigterm"};
+    static const char* const names[] = {"stdin",  "stdout",  "stderr",  "opened",  "failed",
+                                        "closed", "execute", "version", "sigterm", "ready"};
     return type < std::size(names) ? names[type] : "unknown";
 }
 

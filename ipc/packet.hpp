@@ -25,6 +25,8 @@ enum packet_type : std::uint32_t {
     packet_execute = 6,
     packet_version = 7,
     packet_sigterm = 8,
+    // channel 0, from a product program: it serves; an older torvad ignores it
+    packet_ready = 9,
 };
 
 // flags of a stdin packet

@@ -63,16 +63,6 @@ pattern_lists parse_patterns(std::string_view text, std::vector<skipped_line>& s
     return lists;
 }
 
-std::size_t patterns_stack_bytes(std::string_view text) {
-    std::size_t most = compile_stack_bytes({});
-    while (!text.empty()) {
-        std::size_t end = std::min(text.find('\n'), text.size());
-        most = std::max(most, compile_stack_bytes(text.substr(0, end)));
-        text.remove_prefix(std::min(end + 1, text.size()));
-    }
-    return most;
-}
-
 permission decide_permission(const pattern_lists& patterns, const std::string& requester_user,
                              const std::string& wanted_user, const std::vector<std::string>& items,
                              match_clock clock, std::vector<tried_line>* tried) {

@@ -42,9 +42,6 @@ std::string describe_skipped(const skipped_line& skipped, std::string_view file_
 // is skipped and added to skipped, so a typo permits less, never more.
 pattern_lists parse_patterns(std::string_view text, std::vector<skipped_line>& skipped);
 
-// The stack parse_patterns may need for text: as much as its deepest line.
-std::size_t patterns_stack_bytes(std::string_view text);
-
 // The decision for one request: refusal is null when permitted, else the
 // text to log. undecided: a pattern could not be matched within its bounds
 // (each match on its own, as clock tells them), and the request is refused

@@ -1,5 +1,5 @@
-// The automaton of one expression as the standard library compiles it, copied
-// into a flat form that the bounded searches walk without recursion.
+// The automaton of one expression, in a flat form that the bounded searches
+// walk without recursion.
 #pragma once
 
 #include <bitset>
@@ -21,7 +21,7 @@ enum class node_kind : std::uint8_t {
     group_end,     // group index closes
     match,         // one character of set index
     accept,
-    unused, // left behind by the library's compiler, never reached
+    unused, // a placeholder left where the reading made it, never reached
 };
 
 struct node {
@@ -43,15 +43,9 @@ struct automaton {
     bool has_backrefs = false;
 };
 
-// The library's compiler reads the number of a back-reference or a repeat
-// count into a long without a check: nineteen digits may overflow it, which is
-// undefined behaviour. True when source has such a number, or looks to have.
-bool has_oversized_number(std::string_view source);
-
-// Compiles source as ECMAScript with the standard library's own compiler, so
-// exactly what std::regex accepts is accepted; throws std::regex_error. Not for
-// a source with an oversized number. That compiler recurses per nesting level
-// and per term: run it on a large stack.
+// Reads source as an ECMAScript expression, exactly as std::regex accepts
+// it; throws bad_pattern (matcher/scanner.hpp), also when the automaton would
+// have more than 100,000 nodes.
 automaton compile_automaton(std::string_view source);
 
 // \b as the library decides it: the character before counts only when the

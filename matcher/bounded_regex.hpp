@@ -26,8 +26,8 @@ using match_clock = std::int64_t (*)();
 class bounded_regex {
   public:
     // Compiles source as ECMAScript (case-sensitive, no other flag); nullopt and a short
-    // reason in error when it is not a valid expression (or too large to compile).
-    // The compiler recurses as deep as the line: it needs compile_stack_bytes(source).
+    // reason in error, which says where in the line the fault is, when it is not a valid
+    // expression (or too large to compile).
     static std::optional<bounded_regex> compile(std::string_view source, std::string& error);
 
     // Whole-text match, the same answer std::regex_match(text, std::regex(source,
@@ -40,9 +40,6 @@ class bounded_regex {
 
     std::shared_ptr<const regex::automaton> compiled_;
 };
-
-// The stack the compiler may need for source, however the line is made.
-std::size_t compile_stack_bytes(std::string_view source);
 
 // The bound on one call of match, in milliseconds of its clock. Unoptimized and sanitizer builds
 // search thirty to sixty times slower; they allow forty times as long, so that every build decides

@@ -3,8 +3,9 @@
 // packet owns its payload. Nothing here throws or raises SIGPIPE.
 //
 // A peer's life: take the fd from the last argument, read `version` first,
-// then send `execute` and `stdin` packets and read what comes back, framed by
-// length, until `sigterm` arrives on channel 0; then end with status 0.
+// say `ready` once it serves, send `execute` and `stdin` packets and read
+// what comes back, framed by length, until `sigterm` arrives on channel 0;
+// then end with status 0.
 #pragma once
 
 #include <cstdint>
@@ -47,6 +48,8 @@ class connection {
     bool execute(std::uint32_t channel, std::uint32_t flags, const std::vector<std::string>& items);
     // Bytes for a channel's standard input; close ends that input after them.
     bool send_stdin(std::uint32_t channel, std::string_view bytes, bool close = false);
+    // Tells torvad the program serves: sent once, when it does.
+    bool send_ready() { return send(0, packet_ready, 0); }
     // From now on a send gives up when torvad takes nothing for ms.
     void limit_send_wait(int ms) { send_wait_ms_ = ms; }
     int fd() const { return fd_; }

@@ -86,10 +86,6 @@ struct account_name {
 };
 account_name split_account(const std::string& user);
 
-// Runs work on a thread with a stack of stack_bytes and waits for it; what
-// work throws is thrown here. False when no such thread could be had.
-bool run_on_large_stack(std::size_t stack_bytes, const std::function<void()>& work);
-
 // The CPU time the calling thread has used, in nanoseconds: the clock that
 // bounds a pattern match (a match_clock).
 std::int64_t thread_cpu_nanoseconds();
@@ -231,6 +227,9 @@ enum class service_state { start_pending, running, stop_pending, stopped };
 os_error report_service_state(service_state state, std::size_t children);
 // A change of that number while running or stopping; nothing otherwise.
 os_error report_service_children(std::size_t count);
+// A start that is still pending goes on: Windows' manager counts its
+// checkpoints; systemd waits for READY=1 without them.
+os_error report_start_progress();
 
 } // namespace torvad::platform
 

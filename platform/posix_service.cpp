@@ -134,4 +134,8 @@ os_error report_service_children(std::size_t count) {
     return notify_service_manager(("STATUS=" + status_text(reported_state)).c_str());
 }
 
+os_error report_start_progress() {
+    return {};
+}
+
 } // namespace torvad::platform

@@ -43,16 +43,35 @@ bool run_service_dispatcher(const std::string& name, const std::function<void()>
     return StartServiceCtrlDispatcherA(table) != 0;
 }
 
-os_error report_service_state(service_state state, std::size_t) {
+namespace {
+
+// A pending start names a checkpoint that grows, and how long until the next.
+DWORD start_checkpoint = 0;
+
+os_error set_status(service_state state) {
     static const DWORD states[] = {SERVICE_START_PENDING, SERVICE_RUNNING, SERVICE_STOP_PENDING,
                                    SERVICE_STOPPED};
     SERVICE_STATUS status{};
     status.dwServiceType = SERVICE_WIN32_OWN_PROCESS;
     status.dwCurrentState = states[static_cast<int>(state)];
     status.dwControlsAccepted = SERVICE_ACCEPT_STOP | SERVICE_ACCEPT_SHUTDOWN;
+    if (state == service_state::start_pending) {
+        status.dwCheckPoint = ++start_checkpoint;
+        status.dwWaitHint = 3000;
+    }
     if (!SetServiceStatus(status_handle, &status))
         return {static_cast<int>(GetLastError()), "SetServiceStatus"};
     return {};
+}
+
+} // namespace
+
+os_error report_service_state(service_state state, std::size_t) {
+    return set_status(state);
+}
+
+os_error report_start_progress() {
+    return set_status(service_state::start_pending);
 }
 
 // The record has no text to name the children in.

@@ -4,7 +4,6 @@
 
 #include <csignal>
 #include <direct.h>
-#include <exception>
 #include <fcntl.h>
 #include <io.h>
 
@@ -115,39 +114,6 @@ os_error read_file(const std::string& path, std::string& content) {
 
 void close_handle(native_handle handle) {
     CloseHandle(handle);
-}
-
-namespace {
-
-struct task {
-    const std::function<void()>& work;
-    std::exception_ptr failure;
-};
-
-DWORD WINAPI run_task(void* argument) {
-    auto* job = static_cast<task*>(argument);
-    try {
-        job->work();
-    } catch (...) {
-        job->failure = std::current_exception();
-    }
-    return 0;
-}
-
-} // namespace
-
-// The stack is reserved, its pages committed as deep as the work goes.
-bool run_on_large_stack(std::size_t stack_bytes, const std::function<void()>& work) {
-    task job{work, nullptr};
-    HANDLE thread = CreateThread(nullptr, stack_bytes, run_task, &job,
-                                 STACK_SIZE_PARAM_IS_A_RESERVATION, nullptr);
-    if (thread == nullptr)
-        return false;
-    WaitForSingleObject(thread, INFINITE);
-    CloseHandle(thread);
-    if (job.failure)
-        std::rethrow_exception(job.failure);
-    return true;
 }
 
 void write_event_record(event_type type, const char* text) {

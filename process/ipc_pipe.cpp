@@ -57,6 +57,8 @@ void process::on_packet(const packet_header& header, const char* payload) {
         route_stdin(header, payload);
     else if (header.type == packet_execute)
         handle_execute(header, payload);
+    else if (header.type == packet_ready && header.channel == 0)
+        owner.child_ready(*this);
 }
 
 void process::route_stdin(const packet_header& header, const char* payload) {

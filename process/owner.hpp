@@ -34,6 +34,8 @@ class process_owner {
     // A launched child has ended with status (its pipes are still open): the
     // owner logs it and decides whether it starts again.
     virtual void child_ended(const process& child, std::uint32_t status) = 0;
+    // A child said on its pipe that it serves; an owner that doesn't ask ignores it.
+    virtual void child_ready(const process& /*child*/) {}
     virtual const pattern_lists& patterns() const = 0;
     virtual const run_facts& facts() const = 0;
     // One line: on the console, and in the event log where the run asked for it.

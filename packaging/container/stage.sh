@@ -1,17 +1,18 @@
 #!/bin/sh
-# Lays out the image's root in $2 from the build in $1: torvad and the demo's
-# core, stripped, the shared libraries they load (the paths ldd gives, which
-# are where the loader looks), the two accounts, and a static busybox for the
+# Lays out the image's root in $2 from the build in $1: torvad, torvad-wrap
+# and the demo's core, stripped, the shared libraries they load (the paths ldd
+# gives, which are where the loader looks), the two accounts, and a static busybox for the
 # tools the demo has run (uname, id) and the shell its stand-in interpreter is.
 #   packaging/container/stage.sh build build/image-root
 set -eu
 build=$1 root=$2
 source=$(dirname "$(realpath "$0")")/../..
 rm -rf "$root"
-mkdir -p "$root/usr/sbin" "$root/usr/local/bin" "$root/bin" "$root/etc" "$root/opt/torvad"
+mkdir -p "$root/usr/sbin" "$root/usr/bin" "$root/usr/local/bin" "$root/bin" "$root/etc" "$root/opt/torvad"
 strip -o "$root/usr/sbin/torvad" "$build/torvad"
+strip -o "$root/usr/bin/torvad-wrap" "$build/torvad-wrap"
 strip -o "$root/opt/torvad/core" "$build/demo_core"
-ldd "$build/torvad" "$build/demo_core" |
+ldd "$build/torvad" "$build/torvad-wrap" "$build/demo_core" |
     awk '/\(0x/ { for (i = 1; i <= NF; i++) if ($i ~ /^\//) print $i }' | sort -u |
     while read -r library; do
         mkdir -p "$root$(dirname "$library")"

@@ -20,6 +20,8 @@ bool squat(const std::string& calls);
 bool console_event(int n);
 // Makes a pipe and starts torvad with -a on its far end (theirs).
 bool start_attached(const std::string& torvad, int& ours, long& theirs);
+// One datagram to NOTIFY_SOCKET, as a server that speaks systemd's notify protocol.
+bool notify(const std::string& message);
 // Named powershell or schtasks on Windows, stands in for it: its exit code, else -1.
 int stand_in_for_tool(const char* self);
 

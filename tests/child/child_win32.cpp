@@ -47,6 +47,10 @@ static DWORD parent_id() {
     return parent;
 }
 
+bool notify(const std::string&) {
+    return false;
+}
+
 // Left open until we end, as a squatter would hold them; then whether any
 // was connected (a look at a pipe that nobody opened fails, listening).
 bool squat(const std::string& calls) {

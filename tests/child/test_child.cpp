@@ -194,6 +194,14 @@ int main(int argc, char** argv) {
         return await_sigterm(link);
     }
     // "exit CODE [SECONDS]s": the unit keeps a bare number from being taken for the ipc fd.
+    // Each argument a notify datagram ("big": READY=1 in one too long to
+    // take); then it waits for a signal, as a server does.
+    if (mode == "notify") {
+        for (const auto& message : how.args)
+            child_host::notify(message == "big" ? "READY=1\n" + std::string(5000, 'x') : message);
+        for (say("notified");;)
+            std::this_thread::sleep_for(std::chrono::hours(1));
+    }
     if (mode == "exit")
         return std::this_thread::sleep_for(std::chrono::seconds(how.number(1))), how.number(0);
     // Speaks as torvad on the ipc fd it was given: output of channel 9.

@@ -58,10 +58,15 @@ perl -MSocket -e 'socket(S, PF_UNIX, SOCK_DGRAM, 0) && bind(S, pack_sockaddr_un(
 listener=$!
 within 5 test -S "$store/notify"
 # On a read-only root the demo's core can't leave its marker and doesn't fail
-# once: the core that READY=1 follows is the one that stays.
-NOTIFY_SOCKET=$store/notify p run -d --name ready --read-only --sdnotify=container "$image" >/dev/null
+# once: the core that READY=1 follows is the one that stays. With -r, READY=1
+# waits for core's own word.
+NOTIFY_SOCKET=$store/notify p run -d --name ready --read-only --sdnotify=container "$image" -r \
+    >/dev/null
 conmon=$(p inspect -f '{{.State.ConmonPid}}' ready)
 check "sdnotify=container: READY=1 comes once core runs" within 10 grep -q "^READY=1.* $conmon " "$store/notify.log"
+check "-r: READY=1 follows core's ready" logs_have ready "the product is ready."
+check "torvad-wrap runs a program in the image" \
+    test "$(p run --rm "$image" -o -- torvad-wrap busybox echo wrapped 2>&1 | grep -c wrapped)" = 1
 p run -d --name demo "$image" >/dev/null
 check "podman logs show a relayed output" within 10 logs_have demo "core: 'uname -sr' says: Linux"
 check "podman logs show the two refusals" within 10 refusals 2

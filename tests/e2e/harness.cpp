@@ -155,6 +155,7 @@ const std::string child_binary = built(TEST_CHILD_BINARY, "tests/test_child");
 const std::string child_file =
     windows_build ? std::string(windows_build) + "/tests/test_child.exe" : TEST_CHILD_BINARY;
 const std::string tool_binary = built(TORVAD_PATTERNS_BINARY, "torvad-patterns.exe");
+const std::string wrap_binary = built(TORVAD_WRAP_BINARY, "torvad-wrap.exe");
 const std::string torvad_name = windows_build ? "torvad.exe" : "torvad";
 
 bool holds_here(systems where) {
@@ -296,6 +297,8 @@ void run_scenario(const std::vector<std::string>& args, const std::vector<std::s
                           "\n");
         else if (step[0] == '=')
             EXPECT_EQ(run.wait_exit(), std::atoi(text.c_str())) << out;
+        else if (step[0] == '$')
+            EXPECT_EQ(std::system(text.c_str()), 0) << text << "\n" << out;
         else if (step == "z")
             EXPECT_TRUE(no_zombie_within(run.pid_, event_wait_ms)) << out;
         else if (step[0] == '&')

@@ -11,7 +11,8 @@ namespace e2e {
 extern const bool under_wine;
 // The programs as torvad names them; the name torvad's version packet gives
 // it; the test child's file as this system names it.
-extern const std::string torvad_binary, child_binary, tool_binary, torvad_name, child_file;
+extern const std::string torvad_binary, child_binary, tool_binary, wrap_binary, torvad_name,
+    child_file;
 
 enum class systems { both, linux_only, windows_only };
 bool holds_here(systems where);
@@ -37,6 +38,7 @@ inline const options on_linux{.where = systems::linux_only},
 //   "&text" waits for text anywhere                 "z" no child of torvad is a zombie
 //   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
 //   "Ppath" the file at path holds torvad's pid and a line feed
+//   "$command" a shell command of the test's own, which must succeed
 // With a manager: "@message" expects its next report, "@*" drops those still
 // unread, "@" expects none, "!USR2" sends torvad a SIGUSR2.
 // Under Wine every stop request is Ctrl-C typed at the console.

@@ -134,3 +134,28 @@ TEST(product, the_program_here_starts_with_its_account) {
                       : "");
     }
 }
+
+// The Python peer: the demo's core in Python as the product's core (the
+// patterns hold, it fails once, is ready once started again, ends at
+// sigterm), and a child that checks its promises, then speaks through asyncio.
+TEST(product, python_peer) {
+    scratch_dir dir;
+    const std::string source = SOURCE_DIR;
+    std::filesystem::copy(source + "/examples/demo_core.py", dir.path + "/core");
+    std::filesystem::copy(DEMO_PATTERNS, dir.path + "/exec.patterns");
+    const options python{.env = {"PYTHONPATH=" + source + "/peer/python"},
+                         .where = systems::linux_only};
+    run_rows({
+        {{"-r", "-d", dir.path},
+         {"?core: supervised by torvad 1.1.21.0", "?failing once on purpose",
+          "?starting 'core' again.", "?the product is ready.", "&core: 'uname -sr' says: Linux",
+          "&'cat /etc/shadow' refused with status 13", "!INT",
+          "?core: asked to stop, ending cleanly", "?'core' exited with 0x0.", "=0"},
+         python},
+        {{"-r", "--", "python3", source + "/tests/child/test_child.py"},
+         {"?child: promises kept", "?child: version torvad 1.1.21.0",
+          "?child: cat says: relayed through cat", "?child: cat ended with 0",
+          "&the product is ready.", "!INT", "?child: sigterm", "?'python3' exited with 0x0.", "=0"},
+         python},
+    });
+}

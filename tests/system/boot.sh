@@ -12,8 +12,8 @@ mount --bind /sys "$root/sys"
 mount --rbind /dev "$root/dev"
 for dir in run tmp; do mount -t tmpfs tmpfs "$root/$dir"; done
 mkdir "$cgroup" && echo 0 > "$cgroup/cgroup.procs"
-# No database server, no login prompts on the machine's terminals.
-rm -f "$root"/etc/systemd/system/*.wants/postgresql*
+# No database servers, no login prompts on the machine's terminals.
+rm -f "$root"/etc/systemd/system/*.wants/postgresql* "$root"/etc/systemd/system/*.wants/redis*
 for unit in getty.target console-getty.service getty@.service serial-getty@.service \
     container-getty@.service; do ln -sf /dev/null "$root/etc/systemd/system/$unit"; done
 export container=other

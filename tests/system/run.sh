@@ -51,6 +51,9 @@ printf '[Manager]\nDefaultTimeoutStartSec=4s\n' | put /etc/systemd/system.conf.d
 
 put /var/tmp/torvad.deb "$deb"
 check "the package installs" inside dpkg -i /var/tmp/torvad.deb
+# Compiled on import, as root's python3 does, beside the file.
+check "Debian's python3 finds the Python peer" \
+    inside env -u PYTHONDONTWRITEBYTECODE /usr/bin/python3 -c "import torvad_peer"
 # -l: each line is also a record of the system's log, of its level's priority,
 # with torvad's name and pid, its text alone; without -l, none.
 logged() { inside journalctl --no-pager -o verbose SYSLOG_IDENTIFIER=torvad SYSLOG_FACILITY=3 \
@@ -112,8 +115,22 @@ check "hand-over: core is still active (running) past the start timeout" runs_co
 check "hand-over: the same core, never restarted" test "$main" != 0 -a "$(prop torvad MainPID)" = "$main"
 check "hand-over: the job's unit files stay valid" units_valid
 
+# A server nobody here wrote, under torvad-wrap and -r: the start returns once it
+# serves, though it takes two seconds to begin; the stop is its own shutdown.
+printf '%s\n' '[Service]' 'Type=notify' "ExecStart=torvad -r -- torvad-wrap sh -c 'sleep 2; \
+exec redis-server --supervised systemd --port 6393 --save \"\" --appendonly no'" |
+    put /etc/systemd/system/wrapped.service /dev/stdin
+inside systemctl daemon-reload
+check "a wrapped server: start returns once it serves" inside sh -c \
+    'systemctl start wrapped && redis-cli -p 6393 ping | grep -qx PONG'
+inside systemctl stop wrapped
+check "a wrapped server: its stop is its own" within 10 inside sh -c \
+    "journalctl --no-pager -u wrapped | grep -q 'bye bye'"
+check "a wrapped server: it ends with 0" is wrapped Result success
+
 check "removal: the package goes" inside dpkg -r torvad
 check "removal: the service is stopped" within 10 not inside pgrep -f 'torvad|sleep infinity'
 check "removal: no unit is left" is torvad LoadState not-found
 check "removal: no alias is left" inside test ! -L /etc/systemd/system/torvaSentryServer.service
+check "removal: no Python peer is left" test -z "$(inside find /usr/lib/python3 -name 'torvad_peer*')"
 summary " ($(($(date +%s) - start)) s)"

@@ -53,16 +53,12 @@ TEST(bounded_regex, refuses_what_the_library_refuses) {
     }
 }
 
-// As the daemon loads them: on the stack their deepest line asks for.
+// Nesting and length cost the parser heap, not stack: these load on any thread.
 TEST(bounded_regex, compiles_lines_deeper_than_a_default_stack) {
     const std::pair<std::string, std::string> rows[] = {
         {std::string(30000, '(') + "a" + std::string(30000, ')'), "a"},
         {std::string(99000, 'a'), std::string(99000, 'a')},
     };
-    for (const auto& [line, text] : rows) {
-        match_verdict result = undecided;
-        ASSERT_TRUE(platform::run_on_large_stack(compile_stack_bytes(line),
-                                                 [&] { result = verdict(line, text); }));
-        EXPECT_EQ(result, yes);
-    }
+    for (const auto& [line, text] : rows)
+        EXPECT_EQ(verdict(line, text), yes);
 }

@@ -65,7 +65,8 @@ TEST(codec, packets_match_their_bytes) {
          {std::pair{15u, false}, {16u, true}, {65536u, true}, {65537u, false}})
         EXPECT_EQ(valid_packet_length(length), valid) << length;
     EXPECT_STREQ(packet_type_name(packet_sigterm), "sigterm");
-    EXPECT_STREQ(packet_type_name(9), "unknown");
+    EXPECT_STREQ(packet_type_name(packet_ready), "ready");
+    EXPECT_STREQ(packet_type_name(10), "unknown");
 }
 
 TEST(trace, channel_labels_name_known_modules) {
@@ -91,7 +92,7 @@ TEST(trace, details_by_packet_type) {
         {packet_failed, 13, "", "failed", "status=0xd"},
         {packet_closed, 0xfffffffe, "", "closed", "status=0xfffffffe"},
         {packet_sigterm, 7, "", "sigterm", ""},
-        {9, 7, "zz", "unknown", ""},
+        {10, 7, "zz", "unknown", ""},
         {packet_execute, 9, join_strings({"svc", "a\"b", ""}), "execute",
          "\"svc\" \"a\\\"b\" \"\" flags=0x9"},
         {packet_version, 0, version_payload("torvad", torvad_version, false), "version",

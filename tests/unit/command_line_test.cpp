@@ -13,9 +13,10 @@ TEST(command_line, options_values_and_the_end_of_the_scan) {
         auto c = torvad::scan_command_line(static_cast<int>(argv.size()), argv.data());
         std::string text =
             std::string(c.help ? "h" : "") + (c.verbose ? "v" : "") + (c.logging ? "l" : "") +
-            (c.background ? "b" : "") + (c.no_restart ? "o" : "") + " f=" + c.family +
-            " u=" + c.user + " d=" + c.directory + " p=" + (c.pid_file ? c.pid_file : "null") +
-            " a=" + std::to_string(c.attach_pid) + "," + std::to_string(c.attach_pipe);
+            (c.background ? "b" : "") + (c.no_restart ? "o" : "") + (c.readiness ? "r" : "") +
+            " f=" + c.family + " u=" + c.user + " d=" + c.directory +
+            " p=" + (c.pid_file ? c.pid_file : "null") + " a=" + std::to_string(c.attach_pid) +
+            "," + std::to_string(c.attach_pipe);
         for (const auto& word : c.command)
             text += " [" + word + "]";
         return text;
@@ -30,8 +31,8 @@ TEST(command_line, options_values_and_the_end_of_the_scan) {
         {{"-a", "12x", "7"}, " f=torvaSentry u= d= p=null a=12,7"},
         {{"-a", "1234"}, " f=torvaSentry u= d= p=null a=1234,-1"},
         {{"-a", "9", "x", "-a", "abc"}, " f=torvaSentry u= d= p=null a=0,0"},
-        {{"-o", "-b", "-f", "fam", "-u", "svc", "--", "prog", "-v", "--"},
-         "bo f=fam u=svc d= p=null a=0,-1 [prog] [-v] [--]"},
+        {{"-o", "-r", "-b", "-f", "fam", "-u", "svc", "--", "prog", "-v", "--"},
+         "bor f=fam u=svc d= p=null a=0,-1 [prog] [-v] [--]"},
         {{"-v", "--"}, "v" + plain},
         {{"-l", "-help", "-v", "-p", "x"}, "hl" + plain},
         {{"-h", "--", "prog"}, "h" + plain},

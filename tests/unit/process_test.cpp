@@ -247,7 +247,7 @@ TEST(process, packets_are_framed_across_reads_and_traced) {
          {"<- peer:5 stdin abc", "channel 0x5 does not exist"}},
         {{packet_bytes(7, packet_stdin, 0, "", 15) + stdin5, stdin6},
          {"bad ipc packet length", "<- peer:6 stdin x flags=0x1", "channel 0x6 does not exist"}},
-        {{packet_bytes(0x500003, 9, 4, "zz") + packet_bytes(1, packet_sigterm, 0, "")},
+        {{packet_bytes(0x500003, 10, 4, "zz") + packet_bytes(1, packet_sigterm, 0, "")},
          {"<- peer:psfile:3 unknown ", "<- peer:1 sigterm "}},
     };
     for (auto [pieces, lines] : rows) {

@@ -1,0 +1,61 @@
+// The system calls under torvad-wrap, one file for each system
+// (program_posix.cpp, program_win32.cpp): the wrapped program's start, stop
+// and end, its notify socket, and the wrapper's own signals.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace torvad::wrap {
+
+struct running_program {
+    long pid = 0;
+    std::intptr_t handle = 0; // Windows: the process handle
+};
+
+// The stop signal an option names ("TERM", "SIGHUP", "2"); -1 for none the
+// system knows. Windows has one stop, Ctrl-Break, named "BREAK".
+int signal_by_name(const std::string& name);
+int default_stop_signal();
+
+// Keeps the ipc link from the program: it is torvad's pipe to us alone.
+void keep_link_from_program(long link);
+
+// Starts command with our own standard streams, in a process group of its
+// own, with NOTIFY_SOCKET set to notify_address when that isn't empty.
+// Returns 0, or the error number of the failed start.
+int start_program(const std::vector<std::string>& command, const std::string& notify_address,
+                  running_program& out);
+// Asks the program to stop its own way: the signal to its process group on
+// Linux, Ctrl-Break to its process group on Windows.
+bool stop_program(const running_program& program, int stop_signal);
+// Waits for the program's end: its status is its exit code, or 128 + the
+// signal that ended it, also named.
+struct program_end {
+    int status = 0;
+    int signal = 0;
+};
+program_end wait_for_program(const running_program& program);
+// The text of an error number, for a log line.
+std::string error_text(int error);
+
+// A datagram socket of our own for the program's notify messages; fd -1, an
+// empty address and the error where there is none.
+struct notify_socket {
+    long fd = -1;
+    std::string address;
+    int error = 0;
+};
+notify_socket open_notify_socket();
+// Blocks for the next message into buffer: its size, -1 on an error; a
+// message that didn't fit is flagged too long and its size is what it was.
+long receive_notification(const notify_socket& socket, char* buffer, std::size_t size,
+                          bool& too_long);
+
+// Our own stop requests (SIGTERM, SIGHUP; a console's close) call on_stop on
+// a thread of their own; Ctrl-C at the console is torvad's to act on.
+void watch_own_stop_requests(void (*on_stop)());
+
+} // namespace torvad::wrap

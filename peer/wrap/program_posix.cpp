@@ -1,0 +1,136 @@
+#include <cerrno>
+#include <csignal>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <pthread.h>
+#include <spawn.h>
+#include <string_view>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <thread>
+#include <unistd.h>
+
+#include "peer/wrap/program.hpp"
+
+extern char** environ;
+
+namespace torvad::wrap {
+
+int signal_by_name(const std::string& name) {
+    std::string_view word = name;
+    if (word.starts_with("SIG"))
+        word.remove_prefix(3);
+    for (int number = 1; number < NSIG; ++number) {
+        const char* abbreviation = sigabbrev_np(number);
+        if ((abbreviation != nullptr && word == abbreviation) || word == std::to_string(number))
+            return number;
+    }
+    return -1;
+}
+
+int default_stop_signal() {
+    return SIGTERM;
+}
+
+void keep_link_from_program(long link) {
+    int fd = static_cast<int>(link);
+    int flags = fcntl(fd, F_GETFD);
+    if (flags != -1)
+        fcntl(fd, F_SETFD, flags | FD_CLOEXEC);
+}
+
+// The program starts as a program started by a shell would: default signal
+// actions, nothing blocked, though we ignore Ctrl-C and hold our stop signals.
+int start_program(const std::vector<std::string>& command, const std::string& notify_address,
+                  running_program& out) {
+    if (notify_address.empty() ? unsetenv("NOTIFY_SOCKET") == -1
+                               : setenv("NOTIFY_SOCKET", notify_address.c_str(), 1) == -1)
+        return errno;
+    posix_spawnattr_t attributes;
+    if (int error = posix_spawnattr_init(&attributes))
+        return error;
+    sigset_t none, all;
+    sigemptyset(&none);
+    sigfillset(&all);
+    posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETPGROUP | POSIX_SPAWN_SETSIGMASK |
+                                              POSIX_SPAWN_SETSIGDEF);
+    posix_spawnattr_setpgroup(&attributes, 0);
+    posix_spawnattr_setsigmask(&attributes, &none);
+    posix_spawnattr_setsigdefault(&attributes, &all);
+    std::vector<char*> argv;
+    for (const auto& item : command)
+        argv.push_back(const_cast<char*>(item.c_str()));
+    argv.push_back(nullptr);
+    pid_t pid = 0;
+    int error = posix_spawnp(&pid, argv[0], nullptr, &attributes, argv.data(), environ);
+    posix_spawnattr_destroy(&attributes);
+    out.pid = pid;
+    return error;
+}
+
+bool stop_program(const running_program& program, int stop_signal) {
+    return kill(-static_cast<pid_t>(program.pid), stop_signal) == 0;
+}
+
+program_end wait_for_program(const running_program& program) {
+    int status = 0;
+    while (waitpid(static_cast<pid_t>(program.pid), &status, 0) == -1)
+        if (errno != EINTR)
+            return {128, 0};
+    if (WIFEXITED(status))
+        return {WEXITSTATUS(status), 0};
+    return {128 + WTERMSIG(status), WTERMSIG(status)};
+}
+
+std::string error_text(int error) {
+    return std::strerror(error);
+}
+
+// An abstract address the kernel picks (autobind): unique, and gone with us.
+notify_socket open_notify_socket() {
+    int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    if (fd == -1)
+        return {-1, {}, errno};
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    socklen_t length = sizeof address.sun_family;
+    if (bind(fd, reinterpret_cast<sockaddr*>(&address), length) == -1 ||
+        (length = sizeof address,
+         getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length) == -1)) {
+        int error = errno;
+        close(fd);
+        return {-1, {}, error};
+    }
+    std::string name(address.sun_path + 1, length - sizeof address.sun_family - 1);
+    return {fd, "@" + name, 0};
+}
+
+long receive_notification(const notify_socket& socket, char* buffer, std::size_t size,
+                          bool& too_long) {
+    for (;;) {
+        ssize_t got = recv(static_cast<int>(socket.fd), buffer, size, MSG_TRUNC);
+        if (got == -1 && errno == EINTR)
+            continue;
+        too_long = got > static_cast<ssize_t>(size);
+        return got;
+    }
+}
+
+void watch_own_stop_requests(void (*on_stop)()) {
+    signal(SIGINT, SIG_IGN);
+    sigset_t stops;
+    sigemptyset(&stops);
+    sigaddset(&stops, SIGTERM);
+    sigaddset(&stops, SIGHUP);
+    // Blocked before any thread starts, so that only the watcher takes them.
+    pthread_sigmask(SIG_BLOCK, &stops, nullptr);
+    std::thread([stops, on_stop] {
+        for (int number = 0;;)
+            if (sigwait(&stops, &number) == 0)
+                on_stop();
+    }).detach();
+}
+
+} // namespace torvad::wrap

@@ -1,0 +1,145 @@
+// torvad-wrap: puts a program that doesn't speak torvad's protocol under
+// torvad. It speaks the protocol on the pipe torvad gives it, runs the program
+// with its own standard streams, turns sigterm into the program's own stop
+// and the program's notify READY=1 into the ready packet, and ends with the
+// program's status, so that a failure is restarted as any child's is.
+//   torvad [options] -- torvad-wrap [-s signal] [-i] [--] program args
+#include <atomic>
+#include <cstdio>
+#include <cstring>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <vector>
+
+#include "peer/peer.hpp"
+#include "peer/wrap/program.hpp"
+
+namespace {
+
+using namespace torvad;
+
+struct wrap_options {
+    int stop_signal = wrap::default_stop_signal();
+    bool ready_at_once = false;
+    std::vector<std::string> command;
+};
+
+const char* const usage = "Usage: torvad -- torvad-wrap <options> [--] <program> <args>\n"
+                          "  -s  <signal> that stops the program (default TERM)\n"
+                          "  -i  ready at once, not at the program's READY=1\n";
+
+// Options come first; the first other word, or what follows "--", is the
+// program. The last argument is torvad's pipe, no word of the program's.
+bool scan(int argc, char** argv, wrap_options& out) {
+    int i = 1;
+    for (; i < argc - 1 && argv[i][0] == '-'; ++i) {
+        std::string_view option = argv[i];
+        if (option == "--") {
+            ++i;
+            break;
+        }
+        if (option == "-i")
+            out.ready_at_once = true;
+        else if (option == "-s" && i + 1 < argc - 1)
+            out.stop_signal = wrap::signal_by_name(argv[++i]);
+        else
+            return false;
+    }
+    out.command.assign(argv + i, argv + argc - 1);
+    return out.stop_signal > 0 && !out.command.empty();
+}
+
+// What the stop requests share with the end: the program once started, and
+// the signal once one was sent to stop it.
+wrap::running_program program;
+std::atomic<bool> started = false;
+std::atomic<int> stop_sent = 0;
+int stop_signal = 0;
+
+void stop() {
+    if (!started)
+        return;
+    stop_sent = stop_signal;
+    wrap::stop_program(program, stop_signal);
+}
+
+// The version, first, is passed over like any packet but sigterm: the
+// program starts without waiting for it. Every sigterm stops it again; the
+// end of the pipe means torvad is gone, and the program is stopped the same
+// way rather than left behind.
+void follow_link(peer::connection& link) {
+    peer::packet packet;
+    while (link.receive(packet))
+        if (packet.header.type == packet_sigterm && packet.header.channel == 0)
+            stop();
+    std::fprintf(stderr, "torvad-wrap: torvad's pipe closed; stopping the program.\n");
+    stop();
+}
+
+// A message is lines of NAME=value; READY=1 among them is the one we act on,
+// the first time. One too long for the buffer is dropped whole, as systemd does.
+void follow_notifications(const wrap::notify_socket& socket, peer::connection& link) {
+    char buffer[4096];
+    bool ready = false, too_long = false;
+    for (long got;
+         (got = wrap::receive_notification(socket, buffer, sizeof buffer, too_long)) >= 0;) {
+        if (too_long) {
+            std::fprintf(stderr, "torvad-wrap: a notify message of %ld bytes ignored.\n", got);
+            continue;
+        }
+        std::string_view message(buffer, static_cast<std::size_t>(got));
+        for (std::size_t at = 0, end; !ready && at <= message.size(); at = end + 1) {
+            end = std::min(message.find('\n', at), message.size());
+            ready = message.substr(at, end - at) == "READY=1" && link.send_ready();
+        }
+    }
+}
+
+[[noreturn]] void end_with(int status) {
+    std::fflush(nullptr);
+    // The reading threads still use the link on run's stack: end without
+    // unwinding anything.
+    std::_Exit(status);
+}
+
+int run(int argc, char** argv) {
+    wrap_options options;
+    int fd = peer::ipc_fd_from_arguments(argc, argv);
+    if (fd < 0 || !scan(argc, argv, options))
+        return std::fputs(usage, stderr), 2;
+    stop_signal = options.stop_signal;
+    wrap::watch_own_stop_requests(stop);
+    wrap::keep_link_from_program(fd);
+    peer::connection link(fd);
+    wrap::notify_socket socket;
+    if (!options.ready_at_once)
+        socket = wrap::open_notify_socket();
+    if (socket.error != 0)
+        std::fprintf(stderr,
+                     "torvad-wrap: no NOTIFY_SOCKET for the program (%s); -i makes it "
+                     "ready at once.\n",
+                     wrap::error_text(socket.error).c_str());
+    if (int error = wrap::start_program(options.command, socket.address, program)) {
+        std::fprintf(stderr, "torvad-wrap: cannot run '%s': %s\n", options.command[0].c_str(),
+                     wrap::error_text(error).c_str());
+        return error;
+    }
+    started = true;
+    if (options.ready_at_once)
+        link.send_ready();
+    // Both threads block in reads to the end: the process's exit ends them.
+    std::thread([&link] { follow_link(link); }).detach();
+    if (socket.fd >= 0)
+        std::thread([&socket, &link] { follow_notifications(socket, link); }).detach();
+    // A program ended by the very signal sent to stop it has ended cleanly,
+    // as service managers count it.
+    wrap::program_end end = wrap::wait_for_program(program);
+    end_with(end.signal != 0 && end.signal == stop_sent ? 0 : end.status);
+}
+
+} // namespace
+
+int main(int argc, char** argv) {
+    end_with(run(argc, argv));
+}
