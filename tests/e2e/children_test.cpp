@@ -71,6 +71,14 @@ TEST(children, launch_exit_restart_and_stop) {
           "?child: ready", "&child: orphan adopted by torvad\n", "z", "!TERM", "?child: sigterm",
           "=0"},
          on_linux},
+        // a container's first process without the runtime's socket: the service path all the same
+        {child({"peer"}),
+         {"?child: ready", "!TERM", "?child: sigterm", "=0"},
+         {.terminal = false,
+          .shell = "mount --make-rprivate / && mount -t proc p /proc",
+          .first_process = true,
+          .where = systems::linux_only,
+          .as_root = true}},
         // when a requester ends, its channels lose their pipes and run on: a
         // cat there sees the end of its input and ends; so does one that was
         // restarted, though its id left the requester when its predecessor closed

@@ -24,6 +24,7 @@ struct options {
     std::string shell;             // run first, as a careless parent leaves the start state
     std::string program;           // run instead of torvad
     bool manager = false;          // a service manager of the test's own on NOTIFY_SOCKET
+    bool first_process = false;    // PID 1 of PID and mount namespaces of its own (Linux)
     systems where = systems::both; // where a row of run_rows holds
     bool as_root = false;          // a row of run_rows that holds only when we are root
 };
@@ -39,7 +40,7 @@ inline const options on_linux{.where = systems::linux_only},
 //   "!GROUP" Ctrl-C at the terminal, to torvad's whole process group
 //   "Ppath" the file at path holds torvad's pid and a line feed
 //   "$command" a shell command of the test's own, which must succeed
-// With a manager: "@message" expects its next report, "@*" drops those still
+// With a manager: "@message" expects its next report (a regex), "@*" drops those still
 // unread, "@" expects none, "!USR2" sends torvad a SIGUSR2.
 // Under Wine every stop request is Ctrl-C typed at the console.
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,

@@ -1,7 +1,6 @@
 // The product on Linux: the service path's reports to the manager, and the
 // start of the server family or web service with stubs on PATH that record
-// their arguments. The hand-over to a silent core is checked byte for byte
-// under Wine, and done for real by the systemd suite.
+// their arguments, the hand-over's systemd-run among them.
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -42,45 +41,55 @@ const char* const core_ran = "?core runs as";
 
 } // namespace
 
-// The status text follows the state, naming the persistent children.
+// The status text follows the state, naming the persistent children. The
+// PID file goes at the end.
 TEST(product, service_path_reports_its_states_and_ends_children_in_order) {
-    if (!holds_here(systems::linux_only))
-        GTEST_SKIP() << "the service manager and shell-script stubs are Linux's";
+    scratch_dir dir;
+    const std::vector<std::string> files = {"-p", dir.path + "/pid", "-d", dir.path};
     const char* const running_0 = "@READY=1\nSTATUS=running, 0 children";
     const char* const running_1 = "@READY=1\nSTATUS=running, 1 child";
     const char* const stopping_0 = "@STOPPING=1\nSTATUS=stopping, waiting for 0 children";
     const char* const stopping_1 = "@STOPPING=1\nSTATUS=stopping, waiting for 1 child";
-    const std::pair<std::vector<std::string>, std::vector<std::string>> rows[] = {
+    const options service{.terminal = false, .manager = true, .where = systems::linux_only};
+    options first = service;
+    first.first_process = first.as_root = true;
+    first.shell = "mount --make-rprivate / && mount -t proc p /proc";
+    run_rows({
         // a stray SIGUSR2 changes nothing; a SIGTERM after the end can't kill
         // us; the manager's socket is ours, not the child's
-        {child({"fds"}),
-         {"@STATUS=starting", running_1, "?successfully started", "?child: ready", "!USR2", "!TERM",
+        {child({"fds"}, files),
+         {"@STATUS=starting", running_1, "&successfully started", "&child: ready", "!USR2", "!TERM",
           stopping_1, "?child: sigterm", "?'test_child' exited with 0x0.", "@STATUS=stopped",
-          "!TERM", "=0", "-\x1b", "&child: fds clean", "-notify socket"}},
+          "!TERM", "=0", "-\x1b", "&child: fds clean", "-notify socket", "@"},
+         service},
         // a stop during the start: the first run returns at once, the second
         // still ends the child through its sigterm
-        {child({"peer"}),
+        {child({"peer"}, files),
          {"@STATUS=starting", "!TERM", running_1, stopping_1, "?child: sigterm", "@STATUS=stopped",
-          "=0"}},
+          "=0", "@"},
+         service},
         // a persistent channel counts; the order of the two ends at the stop is open
-        {child({"execute", "1", child_binary, "peer"}),
+        {child({"execute", "1", child_binary, "peer"}, files),
          {"@STATUS=starting", running_1, "@STATUS=running, 2 children", "!TERM",
-          "@STOPPING=1\nSTATUS=stopping, waiting for 2 children", "=0", "@*"}},
-        {{},
+          "@STOPPING=1\nSTATUS=stopping, waiting for 2 children", "=0", "@*"},
+         service},
+        {files,
          {"@STATUS=starting", "?successfully started", running_0, stopping_0, "?stopping torvad",
-          "@STATUS=stopped", "=0"}},
-        {child({"exit", "0"}),
-         {"@STATUS=starting", running_1, "?exited with 0x0.", stopping_0, "@STATUS=stopped", "=0"}},
-    };
-    for (auto [args, steps] : rows) {
-        SCOPED_TRACE(::testing::PrintToString(args));
-        scratch_dir dir;
-        args.insert(args.begin(), {"-p", dir.path + "/pid", "-d", dir.path});
-        steps.push_back("@");
-        run_rows(
-            {{args, steps, {.terminal = false, .manager = true, .where = systems::linux_only}}});
-        EXPECT_FALSE(std::filesystem::exists(dir.path + "/pid"));
-    }
+          "@STATUS=stopped", "=0", "@"},
+         service},
+        {child({"exit", "0"}, files),
+         {"@STATUS=starting", running_1, "?exited with 0x0.", stopping_0, "@STATUS=stopped", "=0",
+          "@"},
+         service},
+        // as a container's first process, with the runtime's socket: the same
+        // reports, and the orphans that come to it are reaped
+        {child({"orphans", "2", dir.path + "/orphaned"}),
+         {"@STATUS=starting", running_1, "?child: orphans made", "?'test_child' exited with 0x3.",
+          "?child: ready", "&child: orphan adopted by torvad\n", "z", "!TERM", stopping_1,
+          "?child: sigterm", "@STATUS=stopped", "=0", "@"},
+         first},
+    });
+    EXPECT_FALSE(std::filesystem::exists(dir.path + "/pid"));
 }
 
 // core runs under the account its init script names (the stub powershell's
@@ -99,8 +108,9 @@ TEST(product, the_program_here_starts_with_its_account) {
         {"echo root; exit 3",
          {"?server init script exited with '3', will not deelevate.", core_ran, "=0"}},
         {nullptr, {"?failed to execute server init script, will not deelevate.", core_ran, "=0"}},
-        // nothing printed: the service manager's socket is kept from the script
-        {"echo $NOTIFY_SOCKET", {core_ran, "=0", "-deelevate", "-failed to open patterns"}},
+        // the service manager's socket is kept from the script, whose account core runs under
+        {"echo ${NOTIFY_SOCKET}nobody",
+         {"?core runs as nobody", "=0", "-deelevate", "-failed to open patterns"}},
         // exec.patterns there (a socket file) but unreadable
         {"printf '\\r\\r\\n'",
          {core_ran, "=0", "-Failed to logon", "&failed to open patterns file 'exec.patterns'"}},
@@ -133,6 +143,33 @@ TEST(product, the_program_here_starts_with_its_account) {
                             site.product + "/./scripts/init.ps1\n.\n---\n"
                       : "");
     }
+}
+
+// core stays silent on "version": the service is handed over to it by a
+// transient systemd timer, its path escaped for the unit file, and torvad
+// ends with 1, leaving its PID file.
+TEST(product, silent_core_hands_the_service_over_and_ends_with_1) {
+    if (!holds_here(systems::linux_only))
+        GTEST_SKIP() << "shell-script stubs are Linux's";
+    installation site;
+    const std::string product = "/a \"b\\ $c%", pid = site.root.path + "/pid";
+    std::filesystem::create_directories(site.root.path + product);
+    site.stub(product + "/core", "echo usage >&2");
+    site.stub("/bin/systemd-run", "");
+    run_scenario({"-f", "acme", "-p", pid, "-d", site.root.path + product},
+                 {"=1", "P" + pid, "-successfully"}, {.env = site.env});
+    const std::string unit = "'/run/systemd/system/acmeServer.service.d";
+    EXPECT_EQ(site.log("systemd-run"),
+              "--unit=startts\n--description=hand the service over to core\n--collect\n--quiet\n"
+              "--on-active=10\n--timer-property=AccuracySec=100ms\n--uid=root\n/bin/sh\n-c\n"
+              "set -e\nmkdir -p " +
+                  unit + "'\ncat > " + unit +
+                  "/handover.conf' <<'END_OF_DROP_IN'\n"
+                  "[Service]\nType=exec\nExecStart=\nExecStart=\"" +
+                  site.root.path +
+                  R"(/a \"b\\ $$$$c%%/core")"
+                  "\nEND_OF_DROP_IN\nsystemctl daemon-reload\n"
+                  "systemctl start torvaSentryServer\n\n---\n");
 }
 
 // The Python peer: the demo's core in Python as the product's core (the

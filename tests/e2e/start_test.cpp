@@ -22,6 +22,10 @@ TEST(start, options_help_and_the_pid_file) {
     const char* const no_pid_file = "-failed to create pid file";
     const options pipe{.terminal = false};
     const char* const debug = "WINEDEBUG=fixme+advapi,+eventlog";
+    const char* const syslog =
+        R"(d=${NOTIFY_SOCKET%/*}; unset NOTIFY_SOCKET; ln $d/notify $d/log; touch $d/null;
+        exec unshare -m sh -c 'mount -B /dev/null $0/null && mount -B $0 /dev && exec "$@"' $d "$@")";
+    const std::string tag = ".{16}torvad\\[\\d+\\]: ";
     const std::string record = ",0x0000,0x00000000,0000000000000000,0x0002,0x00000000,";
     run_rows({
         {{}, {ok, "=0", no_pid_file}},
@@ -40,6 +44,12 @@ TEST(start, options_help_and_the_pid_file) {
         {{"-p", dir.path + "/missing/pid"},
          {ok, "=0", "&failed to create pid file", "-EventSource"},
          {.env = {debug}}},
+        // on Linux each line also goes to syslog's /dev/log (here the manager's
+        // socket, in a /dev of torvad's own): facility daemon, the level's priority
+        {{"-l", "-o", "-p", dir.path + "/missing/pid", "--", child_binary, "exit", "3"},
+         {"@<27>" + tag + "failed to create pid file", "@<30>" + tag + started,
+          "@<28>" + tag + "'test_child' exited with 0x3\\.", "=0", "@"},
+         {.shell = syslog, .manager = true, .where = systems::linux_only, .as_root = true}},
         {{"-a", "4242"}, {"?failed to attach to ipc pipe.", "?executable not specified", "=0"}},
         // a relative PID file name is taken in the starting directory, whatever -d says
         {{"-p", "torvad.pid", "-d", elsewhere.path, "--", child_binary, "peer"},
@@ -47,8 +57,12 @@ TEST(start, options_help_and_the_pid_file) {
          {.directory = dir.path}},
         // help, on stderr, and nothing else: no PID file either
         {{"-p", pid, "-v", "-h", "-p"},
-         {"?torvad version 1.1.21.0\nUsage: " + torvad_binary + " <options> -- <exe> <exe args>\n",
-          "?  -a  <pid> <pipe>\n", "=0", "-successfully"},
+         {"?torvad version 1.1.21.0\nUsage: " + torvad_binary +
+              " <options> -- <exe> <exe args>\n  -h  help\n  -v  verbose\n  -l  enable logging\n"
+              "  -b  start service\n  -o  disable auto restart after failure\n  -r  ready once all "
+              "children say so\n  -f  <product family>\n  -u  <user>\n  -d  <directory>\n  -p  "
+              "<pid file>\n  -a  <pid> <pipe>\n",
+          "=0", "-successfully"},
          pipe},
         {{"-v", "-l", "--", child_binary, "exit", "0"}, {"=0", "-torvad", "-child"}, pipe},
         {{"-b", "--", child_binary, "exit", "0"}, {"=0", "-torvad", "-child"}},

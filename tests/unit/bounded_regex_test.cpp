@@ -1,8 +1,13 @@
 // The bounded matcher where the library's own matcher overflows the stack or
 // never ends, and where it gives up. On short lines and texts it answers as
 // std::regex_match does, quirks included: the differential fuzzer holds that,
-// from seeds that spell each quirk (fuzz/seeds_regex).
+// from seeds that spell each quirk (fuzz/seeds_regex), which are replayed here.
 #include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <regex>
 
 #include "matcher/bounded_regex.hpp"
 #include "platform/platform.hpp"
@@ -42,6 +47,26 @@ TEST(bounded_regex, decides_long_texts_or_gives_up_within_the_bound) {
     };
     for (const auto& [pattern, text, expected] : rows)
         EXPECT_EQ(verdict(pattern, text), expected) << pattern;
+}
+
+// A seed is a pattern, a line feed and a text (or the pattern alone). Where the
+// library takes exponential time, or a stack deeper than a thread's, its answer
+// (on a stack of a gigabyte) is written here.
+TEST(bounded_regex, answers_the_fuzzers_seeds_as_the_library_does) {
+    const std::map<std::string, match_verdict> known = {{"ambiguous", no},
+                                                        {"library_recursion", yes}};
+    for (const auto& seed : std::filesystem::directory_iterator(REGEX_SEEDS)) {
+        std::ifstream file(seed.path(), std::ios::binary);
+        std::string input{std::istreambuf_iterator<char>(file), {}},
+            name = seed.path().filename().string();
+        std::size_t cut = input.find('\n');
+        std::string pattern = input.substr(0, cut),
+                    text = cut == input.npos ? "" : input.substr(cut + 1);
+        EXPECT_EQ(verdict(pattern, text), known.contains(name) ? known.at(name)
+                                          : std::regex_match(text, std::regex(pattern)) ? yes
+                                                                                        : no)
+            << name;
+    }
 }
 
 TEST(bounded_regex, refuses_what_the_library_refuses) {

@@ -2,6 +2,7 @@
 // asks for channels, and the test reads what comes back in the loop's turns.
 #include <gtest/gtest.h>
 
+#include <csignal>
 #include <fstream>
 #include <functional>
 #include <linux/sockios.h>
@@ -43,6 +44,7 @@ struct rig final : process_owner {
     // send_buffer, when given, bounds what torvad's end of the socket holds.
     explicit rig(bool verbose = false, int send_buffer = 0) {
         run.verbose = verbose;
+        signal(SIGPIPE, SIG_IGN); // as torvad's start does: a child that ended closed its end
         int ends[2];
         EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends), 0);
         if (send_buffer != 0)
