@@ -109,6 +109,9 @@ os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed);
 // A relayed standard stream: for stdin (stream 0) the child reads theirs and
 // we write ours; for stdout and stderr (1, 2) the other way round.
 os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs);
+// How many pipe names another program had taken first since the last call;
+// each was tried again under a fresh name (on Windows; a pair has no name).
+int taken_pipe_names();
 // Binds a pipe that another program made and gave us by its handle value.
 os_error attach_pipe(stream& ours, std::int64_t value);
 
@@ -143,8 +146,9 @@ struct launch_request {
 
 // Where a launch failed: the logon to the account, or making the child; or
 // the program was refused, being one whose arguments a command interpreter
-// would read (a batch file on Windows).
-enum class launch_step { none, logon, create, refused };
+// would read (a batch file on Windows), or an item of the launch is no text
+// of the system's code page (unconvertible, on Windows).
+enum class launch_step { none, logon, create, refused, unconvertible };
 
 struct launch_result {
     int pid = 0;

@@ -30,16 +30,20 @@ std::string describe(const os_error& error) {
 namespace {
 
 // The runtime turns the console's Ctrl-C into SIGINT, which the loop waits
-// for; Ctrl-Break and the closing of the console would end us at once,
-// without a sigterm to any child and with the PID file left behind. They are
-// made the same SIGINT. The close ends us when this returns, so it waits
-// here, within the few seconds Windows grants, while the loop stops the
-// children and the program returns.
+// for; Ctrl-Break, the closing of the console and the system's shutdown
+// would end us at once, without a sigterm to any child and with the PID file
+// left behind. They are made the same SIGINT. The close and the shutdown end
+// us when this returns, so it waits here, within the few seconds Windows
+// grants, while the loop stops the children and the program returns. A
+// logoff ends a user's session, not a service's: it is ignored, as a
+// service must, or the default handler would end us with the session.
 BOOL WINAPI stop_on_console_event(DWORD event) {
-    if (event != CTRL_BREAK_EVENT && event != CTRL_CLOSE_EVENT)
+    if (event == CTRL_LOGOFF_EVENT)
+        return TRUE;
+    if (event != CTRL_BREAK_EVENT && event != CTRL_CLOSE_EVENT && event != CTRL_SHUTDOWN_EVENT)
         return FALSE;
     std::raise(SIGINT);
-    if (event == CTRL_CLOSE_EVENT)
+    if (event != CTRL_BREAK_EVENT)
         Sleep(INFINITE);
     return TRUE;
 }

@@ -7,8 +7,18 @@ namespace torvad {
 
 namespace {
 
-// What a failed launch says in -v, beside the line its caller logged.
+// Somebody tries to take our pipes: the launch went on under fresh names, or
+// failed once none was left to try, and the operator is to know either way.
+void report_taken_names(process_owner& owner) {
+    if (int taken = platform::taken_pipe_names())
+        owner.log_warning("another program took %d pipe names first; fresh names were tried.",
+                          taken);
+}
+
+// What a failed launch says beside the line its caller logged: the names
+// taken, and in -v the reason.
 void log_reason(process_owner& owner, const platform::os_error& error) {
+    report_taken_names(owner);
     if (error)
         owner.log_verbose("%s", platform::describe(error).c_str());
 }
@@ -41,6 +51,9 @@ std::uint32_t log_refusal(process_owner& owner, const execute_request& what,
     }
     if (launched.failed_step == platform::launch_step::refused)
         owner.log_error("refused to run '%s': a command interpreter would read its arguments.",
+                        what.command[0].c_str());
+    else if (launched.failed_step == platform::launch_step::unconvertible)
+        owner.log_error("refused to run '%s': an item is no text of the system's code page.",
                         what.command[0].c_str());
     else
         owner.log_error("failed to create child process.");
@@ -96,6 +109,7 @@ bool process::start() {
     // At a console the terminal signals its whole foreground group; only
     // we are to hear Ctrl-C, and stop the children in order.
     request.own_process_group = !owner.facts().background;
+    report_taken_names(owner);
     platform::launch_result launched = platform::launch_child(request);
     // The child has its copies of these now, or never will.
     child_ipc.reset();
