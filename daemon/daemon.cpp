@@ -78,25 +78,27 @@ void daemon::start() {
 }
 
 void daemon::stop_children() {
+    if (life_ == life::shut_down)
+        return;
     log_info("stopping torvad version %s...", torvad_version);
     // terminate never changes the set (an exit is seen later, on the loop),
     // but a copy keeps that a local fact rather than a promise of process.
     auto stopping = children_;
     for (const auto& child : stopping)
-        if (child->parent.expired() || child->persistent)
+        if (child->place.parent.expired() || child->what.persistent)
             child->terminate();
     settings_.auto_restart = false;
     // Nothing escalates after sigterm, so a stop asked for again can only
     // say whom it is waiting for.
-    if (stop_requested_)
+    if (life_ == life::stopping)
         name_awaited_children();
-    stop_requested_ = true;
+    life_ = life::stopping;
 }
 
 void daemon::name_awaited_children() {
     std::string awaited;
     for (const auto& child : children_)
-        if (child->persistent)
+        if (child->what.persistent)
             awaited += (awaited.empty() ? "" : ", ") + child->description();
     if (!awaited.empty())
         log_warning("still waiting for %s to end after sigterm.", awaited.c_str());
@@ -151,9 +153,9 @@ void daemon::stop_loop() {
 }
 
 void daemon::shut_down() {
-    if (shut_down_)
+    if (life_ == life::shut_down)
         return;
-    shut_down_ = true;
+    life_ = life::shut_down;
     boost::system::error_code ignored;
     signals_.cancel(ignored);
     orphan_watch_.close(ignored);
@@ -170,7 +172,7 @@ void daemon::shut_down() {
 }
 
 void daemon::adopt(std::shared_ptr<process> child) {
-    if (child->persistent) {
+    if (child->what.persistent) {
         ++persistent_children_;
         persistent_children_changed();
     }
@@ -178,11 +180,8 @@ void daemon::adopt(std::shared_ptr<process> child) {
 }
 
 void daemon::remove(const std::shared_ptr<process>& child) {
-    // Each process knows its channels: an end costs the same however many
-    // children there are.
-    child->close_channel_pipes();
     ready_children_.erase(child.get());
-    if (children_.erase(child) != 0 && child->persistent) {
+    if (children_.erase(child) != 0 && child->what.persistent) {
         --persistent_children_;
         persistent_children_changed();
     }
@@ -191,27 +190,27 @@ void daemon::remove(const std::shared_ptr<process>& child) {
 }
 
 void daemon::child_ended(const process& child, std::uint32_t status) {
-    bool again = status != 0 && settings_.auto_restart && child.persistent;
+    bool again = status != 0 && settings_.auto_restart && child.what.persistent;
     {
         // Both lines in one console write, and both ahead of the launch.
         console_hold lines(*this);
         if (status == 0)
-            log_info("'%s' exited with 0x%x.", child.name().c_str(), status);
+            log_info("'%s' exited with 0x%x.", child.name.c_str(), status);
         else
-            log_warning("'%s' exited with 0x%x.", child.name().c_str(), status);
+            log_warning("'%s' exited with 0x%x.", child.name.c_str(), status);
         if (again)
-            log_info("starting '%s' again.", child.name().c_str());
+            log_info("starting '%s' again.", child.name.c_str());
     }
     // The successor is in the set before its predecessor leaves, so the run
     // never looks empty across a restart.
     if (again)
-        process::create(*this, child.request(), child.place())->start();
+        process::create(*this, child.what, child.place)->start();
 }
 
 // A successor starts unready, but the product was ready once and stays so:
 // those who waited for it have acted on it already.
 void daemon::child_ready(const process& child) {
-    if (!settings_.readiness || !child.persistent || product_ready_)
+    if (!settings_.readiness || !child.what.persistent || product_ready_)
         return;
     ready_children_.insert(&child);
     if (ready_children_.size() < persistent_children_)

@@ -120,8 +120,13 @@ class daemon final : public process_owner {
     std::unordered_set<const process*> ready_children_;
     bool product_ready_ = false;
     std::function<void()> on_ready_;
-    bool stop_requested_ = false;
-    bool shut_down_ = false;
+    // The daemon's life; a stop or the shutdown moves it:
+    //   state      stop                              shut_down
+    //   running    -> stopping                       -> shut_down
+    //   stopping   names whom it waits for           -> shut_down
+    //   shut_down  nothing                           nothing
+    enum class life { running, stopping, shut_down };
+    life life_ = life::running;
 };
 
 } // namespace torvad

@@ -1,7 +1,5 @@
 #include "entry/handover.hpp"
 
-#include <cstdlib>
-
 #include "entry/first_line.hpp"
 #include "platform/platform.hpp"
 
@@ -23,20 +21,21 @@ answer ask_service_program(const std::string& core_name) {
 
 } // namespace
 
-void check_service_program(const std::string& service_name) {
+service_check check_service_program(const std::string& service_name) {
     try {
         std::string core_name = std::string("core") + platform::exe_suffix;
         if (ask_service_program(core_name) != answer::silent)
-            return;
+            return service_check::go_on;
         // getcwd gives a path with nothing to normalise, so this is the plain
         // absolute name; without a current directory there is nothing to hand over.
         platform::os_error error;
         std::string core_path = platform::absolute_path(core_name, error);
         if (!error && platform::schedule_handover(service_name, core_path))
-            std::exit(1);
+            return service_check::handed_over;
     } catch (...) {
         // Whatever failed, the check counts as passed and the start goes on.
     }
+    return service_check::go_on;
 }
 
 } // namespace torvad

@@ -6,11 +6,11 @@
 
 namespace torvad {
 
-// Runs "core -h" and returns when the first line it writes on stderr holds
-// "version", or when the check or the hand-over can't be made. Otherwise it
-// schedules the one-time job that points service_name at core and starts the
-// service, and ends the process with 1 (a PID file stays). No exception leaves.
-void check_service_program(const std::string& service_name);
-
-// The action of the scheduled task, one string as the scheduler takes it.
+// Runs "core -h": when the first line it writes on stderr holds "version", or
+// when the check or the hand-over can't be made, the start goes on. Otherwise
+// it schedules the one-time job that points service_name at core and starts
+// the service, and says the service is handed over: the run then ends with 1,
+// its PID file left in place. No exception leaves.
+enum class service_check { go_on, handed_over };
+service_check check_service_program(const std::string& service_name);
 } // namespace torvad

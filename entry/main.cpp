@@ -28,22 +28,26 @@ settings settings_of(const command_line& options) {
 std::string write_pid_file(daemon& supervisor, const char* name) {
     if (name == nullptr)
         return {};
-    platform::os_error ignored;
-    std::string path = platform::absolute_path(name, ignored);
+    // Without a current directory the name stays relative, and -v says why.
+    platform::os_error error;
+    std::string path = platform::absolute_path(name, error);
+    if (error)
+        supervisor.log_verbose("%s", platform::describe(error).c_str());
     if (platform::write_pid_file(path, platform::current_process_id()))
         return path;
     supervisor.log_error("failed to create pid file");
     return {};
 }
 
-void choose_what_to_supervise(daemon& supervisor, command_line& options) {
+// False when the service was handed over instead: there is nothing to supervise.
+bool choose_what_to_supervise(daemon& supervisor, command_line& options) {
     if (options.command.empty() && options.attach_pid == 0) {
         // The server program wins when both products are installed here.
         if (platform::path_exists(std::string("core") + platform::exe_suffix))
-            start_server_family(supervisor, options.family);
-        else if (platform::path_exists(std::string("wfe") + platform::exe_suffix))
+            return start_server_family(supervisor, options.family);
+        if (platform::path_exists(std::string("wfe") + platform::exe_suffix))
             start_web_service(supervisor);
-        return;
+        return true;
     }
     auto top = process::create(supervisor, {.command = std::move(options.command),
                                             .user = std::move(options.user),
@@ -55,16 +59,17 @@ void choose_what_to_supervise(daemon& supervisor, command_line& options) {
     if (options.attach_pid != 0)
         top->attach(options.attach_pid, options.attach_pipe);
     supervisor.configure("torvad", nullptr);
+    return true;
 }
 
 // A stop request can come while the product's start runs its programs. At a
 // console a plain kill is one too, taken by the loop once it runs; under the
 // service manager it waits, blocked, for the dispatcher to act on it.
 void take_stop_requests(daemon& supervisor, bool background) {
-    if (background)
-        platform::hold_stop_requests();
-    else
+    if (!background)
         supervisor.add_stop_signal(SIGTERM);
+    else if (platform::os_error error = platform::hold_stop_requests())
+        supervisor.log_verbose("%s", platform::describe(error).c_str());
 }
 
 void supervise(daemon& supervisor, bool background) {
@@ -87,7 +92,7 @@ void supervise(daemon& supervisor, bool background) {
 int run_program(int argc, char** argv) {
     // The start state (standard fds, signal dispositions) comes before any
     // descriptor of ours, so none can take a standard stream's number.
-    platform::prepare_own_process();
+    platform::os_error start_state = platform::prepare_own_process();
     platform::unbuffer_output();
 
     command_line options = scan_command_line(argc, argv);
@@ -97,12 +102,16 @@ int run_program(int argc, char** argv) {
     }
     settings chosen = settings_of(options);
     daemon supervisor(chosen);
+    if (start_state)
+        supervisor.log_verbose("%s", platform::describe(start_state).c_str());
     // Before the start runs any program or thread: see daemon/orphans.cpp.
     supervisor.take_orphans();
 
     std::string pid_file = write_pid_file(supervisor, options.pid_file);
-    platform::os_error ignored;
-    boost::filesystem::path exe_path = platform::absolute_path(argv[0], ignored);
+    platform::os_error error;
+    boost::filesystem::path exe_path = platform::absolute_path(argv[0], error);
+    if (error)
+        supervisor.log_verbose("%s", platform::describe(error).c_str());
     if (options.directory.empty())
         options.directory = exe_path.parent_path().string();
     // A directory that can't be entered leaves us where we started; relative
@@ -110,7 +119,9 @@ int run_program(int argc, char** argv) {
     platform::change_directory(options.directory);
 
     take_stop_requests(supervisor, chosen.background);
-    choose_what_to_supervise(supervisor, options);
+    // A hand-over ends the run at once, and leaves the PID file in place.
+    if (!choose_what_to_supervise(supervisor, options))
+        return 1;
     supervisor.set_program_name(exe_path.filename().string());
     supervise(supervisor, chosen.background);
     supervisor.shut_down();

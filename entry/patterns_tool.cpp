@@ -1,6 +1,8 @@
 #include "entry/patterns_tool.hpp"
 
 #include <algorithm>
+#include <cctype>
+#include <chrono>
 #include <map>
 
 #include "ipc/execute.hpp"
@@ -37,9 +39,69 @@ bool is_blank(char c) {
     return c == ' ' || c == '\t';
 }
 
+// The programs that read their arguments as commands of their own; a
+// permitted item that no quoting can keep from running something else.
+const char* const interpreters[] = {"cmd", "powershell", "pwsh", "wscript", "cscript", "mshta"};
+
+// The pattern of the program, the first item: up to the first \0 that is not
+// itself behind an escaping backslash.
+std::string_view program_part(std::string_view pattern) {
+    for (std::size_t i = 0; i + 1 < pattern.size(); ++i)
+        if (pattern[i] == '\\' && pattern[i + 1] == '0')
+            return pattern.substr(0, i);
+        else if (pattern[i] == '\\')
+            ++i;
+    return pattern;
+}
+
+// The program's name as a literal pattern spells it: behind its last folder,
+// unescaped, lower case, without anchors and an executable's suffix.
+std::string literal_name(std::string_view program) {
+    for (std::string_view separator : {"\\\\", "/"})
+        if (std::size_t at = program.rfind(separator); at != std::string_view::npos)
+            program.remove_prefix(at + separator.size());
+    std::string name;
+    for (char c : program)
+        if (c != '\\' && c != '^' && c != '$')
+            name += static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    for (const char* suffix : {".exe", ".com"})
+        if (name.ends_with(suffix))
+            name.resize(name.size() - 4);
+    return name;
+}
+
+std::int64_t steady_nanoseconds() {
+    return std::chrono::duration_cast<std::chrono::nanoseconds>(
+               std::chrono::steady_clock::now().time_since_epoch())
+        .count();
+}
+
+// A line permits an interpreter when its program is spelled as one, or when
+// the program's pattern takes one of the usual spellings of one.
+bool permits_interpreter(std::string_view pattern) {
+    std::string_view program = program_part(pattern);
+    std::string literal = literal_name(program), error;
+    auto regex = bounded_regex::compile(program, error);
+    for (std::string name : interpreters) {
+        if (literal == name)
+            return true;
+        std::string upper = name;
+        std::transform(name.begin(), name.end(), upper.begin(),
+                       [](unsigned char c) { return static_cast<char>(std::toupper(c)); });
+        for (const std::string& spelled : {name, upper})
+            for (const char* folder : {"", "C:\\Windows\\System32\\"})
+                for (const char* suffix : {"", ".exe", ".EXE"})
+                    if (regex && regex->match(folder + spelled + suffix, steady_nanoseconds) ==
+                                     match_verdict::match)
+                        return true;
+    }
+    return false;
+}
+
 // The warnings on lines that compiled: blanks that are part of the pattern,
-// though an operator rarely means them, and an own-account line that an
-// "(all) " line repeats, which permits nothing more than that line does.
+// though an operator rarely means them, an own-account line that an "(all) "
+// line repeats, which permits nothing more than that line does, and a line
+// that permits a command interpreter.
 void warn(const std::string& path, const pattern_lists& lists, std::string& out, int& count) {
     auto say = [&](const pattern_line& line, const std::string& what) {
         out += path + ":" + std::to_string(line.number) + ": warning: " + what + "\n    " +
@@ -60,6 +122,8 @@ void warn(const std::string& path, const pattern_lists& lists, std::string& out,
         pattern.remove_prefix(for_all ? all_prefix.size() : 0);
         if (!pattern.empty() && (is_blank(pattern.front()) || is_blank(pattern.back())))
             say(*line, "a blank at its start or end is part of the pattern");
+        if (permits_interpreter(pattern))
+            say(*line, "permits a command interpreter, which runs its arguments as commands");
         auto own = own_lines.find(pattern);
         if (for_all && own != own_lines.end())
             say(*line, "repeats line " + std::to_string(own->second) +

@@ -59,11 +59,12 @@ std::string core_account(daemon& supervisor) {
 
 } // namespace
 
-void start_server_family(daemon& supervisor, const std::string& family) {
+bool start_server_family(daemon& supervisor, const std::string& family) {
     std::string service_name = family + "Server";
     // Decided before the script runs: a file the script makes counts next time.
     bool patterns_present = platform::path_exists(patterns_name);
-    check_service_program(service_name);
+    if (check_service_program(service_name) == service_check::handed_over)
+        return false;
     std::string user = core_account(supervisor);
     process::create(supervisor, {.command = {"./core"},
                                  .user = std::move(user),
@@ -71,6 +72,7 @@ void start_server_family(daemon& supervisor, const std::string& family) {
                                  .persistent = true,
                                  .stdio_mode = stdio_inherit});
     supervisor.configure(service_name, patterns_present ? patterns_name : nullptr);
+    return true;
 }
 
 void start_web_service(daemon& supervisor) {

@@ -9,10 +9,11 @@ namespace torvad {
 
 class daemon;
 
-// Asks core whether to stay in front of it (this may end the process), runs
-// the init script for core's account, and names the service family + "Server".
+// Asks core whether to stay in front of it, runs the init script for core's
+// account, and names the service family + "Server". False when the service
+// was handed over to core instead: nothing is made, and the run ends.
 // No exception leaves it but those of process::create and daemon::configure.
-void start_server_family(daemon& supervisor, const std::string& family);
+bool start_server_family(daemon& supervisor, const std::string& family);
 
 // wfe under the local service account, service "WebService", no patterns file.
 void start_web_service(daemon& supervisor);

@@ -68,6 +68,9 @@ bool serve(peer::connection& link) {
 } // namespace
 
 int main(int argc, char** argv) {
+    // A console's Ctrl-Break or close reaches us as it reaches torvad, whose
+    // sigterm is then our orderly end.
+    peer::outlive_console_events();
     // torvad asks this before every start; without "version" on the first
     // line of stderr it would hand the service over to us.
     if (argc > 1 && std::strcmp(argv[1], "-h") == 0) {

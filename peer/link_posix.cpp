@@ -5,8 +5,11 @@
 #include <unistd.h>
 
 #include "peer/link.hpp"
+#include "peer/peer.hpp"
 
 namespace torvad::peer {
+
+void outlive_console_events() {}
 
 bool link_is_open(long value) {
     return value <= 0x7fffffff && fcntl(static_cast<int>(value), F_GETFD) != -1;

@@ -3,6 +3,7 @@
 #include <cstdint>
 
 #include "peer/link.hpp"
+#include "peer/peer.hpp"
 
 namespace torvad::peer {
 
@@ -35,7 +36,20 @@ struct overlapped_call {
     OVERLAPPED call{};
 };
 
+// The close and the shutdown end the program once a handler returns, so the
+// handler holds its thread until the program has ended on its own.
+BOOL WINAPI await_sigterm(DWORD event) {
+    if (event == CTRL_CLOSE_EVENT || event == CTRL_SHUTDOWN_EVENT)
+        Sleep(INFINITE);
+    return event != CTRL_C_EVENT;
+}
+
 } // namespace
+
+void outlive_console_events() {
+    // Without it the program ends as before; there is nothing better to do.
+    (void)SetConsoleCtrlHandler(await_sigterm, TRUE);
+}
 
 bool link_is_open(long value) {
     DWORD flags = 0;

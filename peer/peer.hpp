@@ -73,4 +73,12 @@ std::optional<version_info> parse_version(const packet& received);
 // Reads the first packet, which must be a valid version.
 bool read_version(connection& link, version_info& out);
 
+// Keeps the program running through the events a Windows console sends to
+// every program on it (Ctrl-Break, its close, the system's shutdown, and a
+// logoff, which is a user's and not the service's): torvad hears them too
+// and stops its children in order, so the program ends at its sigterm,
+// not before. Call it first thing in main; nothing to do on Linux, where
+// torvad keeps the terminal's signals from its children.
+void outlive_console_events();
+
 } // namespace torvad::peer

@@ -46,8 +46,9 @@ std::string describe(const os_error& error);
 
 // Makes the start state whatever the parent left: standard streams open,
 // exits of children observable, a peer closing its end only a write error,
-// and no signal blocked.
-void prepare_own_process();
+// and no signal blocked. An error names the first step that failed; the
+// others are made all the same.
+os_error prepare_own_process();
 // Each log line reaches stdout as it is written, with its line feed as it is.
 void unbuffer_output();
 int current_process_id();
@@ -108,6 +109,9 @@ os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed);
 // A relayed standard stream: for stdin (stream 0) the child reads theirs and
 // we write ours; for stdout and stderr (1, 2) the other way round.
 os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs);
+// How many pipe names another program had taken first since the last call;
+// each was tried again under a fresh name (on Windows; a pair has no name).
+int taken_pipe_names();
 // Binds a pipe that another program made and gave us by its handle value.
 os_error attach_pipe(stream& ours, std::int64_t value);
 
@@ -118,10 +122,11 @@ os_error attach_pipe(stream& ours, std::int64_t value);
 // stream has ended.
 boost::system::error_code take_output(stream& pipe, output_buffer& buffer, const char*& data,
                                       std::size_t& size);
-// True while a read armed by await_output may still land bytes: what is in the
-// pipe behind them can't be taken before it has. Ends such a read early.
-bool output_in_flight(const output_buffer& buffer);
-void cut_output_short(stream& pipe);
+// The writer of pipe has ended, so what the pipe holds is all there will be.
+// True when take_output can now take all of it; false while a read armed by
+// await_output may still land bytes ahead of the rest: that read is ended
+// early, its handler runs next, and then this is asked again.
+bool end_output(stream& pipe, output_buffer& buffer);
 
 // --- launching and ending children ---------------------------------------------
 
@@ -141,8 +146,9 @@ struct launch_request {
 
 // Where a launch failed: the logon to the account, or making the child; or
 // the program was refused, being one whose arguments a command interpreter
-// would read (a batch file on Windows).
-enum class launch_step { none, logon, create, refused };
+// would read (a batch file on Windows), or an item of the launch is no text
+// of the system's code page (unconvertible, on Windows).
+enum class launch_step { none, logon, create, refused, unconvertible };
 
 struct launch_result {
     int pid = 0;
@@ -209,7 +215,7 @@ bool reap_orphans(stream& watch);
 
 // Keeps the service manager's stop request (SIGTERM) pending until the
 // dispatcher waits for it, so that it can't end us by its default action.
-void hold_stop_requests();
+os_error hold_stop_requests();
 // Runs service_main on a thread of its own when the service manager started us
 // (or a container runtime, which stands for it), delivering stop requests to
 // on_stop from this thread; false at once otherwise. service_main runs only

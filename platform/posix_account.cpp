@@ -29,30 +29,31 @@ std::string local_account_name(const std::string& user, bool& this_machine) {
 
 } // namespace
 
-int resolve_account(const std::string& user, account& out) {
+os_error resolve_account(const std::string& user, account& out) {
     bool this_machine = false;
     std::string name = local_account_name(user, this_machine);
+    // Another machine's account is none of ours: looked up as it is written,
+    // it is not found.
     if (!this_machine)
-        return ENOENT;
+        name = user;
     std::vector<char> buffer(16384);
     passwd entry{};
     passwd* found = nullptr;
     int error = getpwnam_r(name.c_str(), &entry, buffer.data(), buffer.size(), &found);
-    if (found == nullptr)
-        return error != 0 ? error : ENOENT;
+    if (found == nullptr || !this_machine)
+        return {error != 0 ? error : ENOENT, "getpwnam_r"};
     out.uid = entry.pw_uid;
     out.gid = entry.pw_gid;
+    // Switching needs root; without it the child's setgroups says so.
     out.change = entry.pw_uid != geteuid() || entry.pw_gid != getegid();
     if (!out.change)
-        return 0;
-    if (geteuid() != 0)
-        return EPERM;
+        return {};
     int count = 64;
     std::vector<gid_t> groups(count);
     while (getgrouplist(name.c_str(), entry.pw_gid, groups.data(), &count) == -1)
         groups.resize(count);
     out.groups.assign(groups.begin(), groups.begin() + count);
-    return 0;
+    return {};
 }
 
 } // namespace torvad::platform

@@ -6,14 +6,12 @@
 // rest: a launch costs the same however many descriptors we hold.
 #include "platform/platform.hpp"
 
-#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstring>
 #include <fcntl.h>
 #include <linux/close_range.h>
 #include <sched.h>
-#include <sys/mman.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -48,14 +46,18 @@ struct child_plan {
 
 // Default dispositions before the mask opens, so no handler of ours can
 // ever run in the child.
-void reset_signals() {
+void reset_signals(child_plan& plan) {
     struct sigaction default_action = {};
     default_action.sa_handler = SIG_DFL;
+    // SIGKILL, SIGSTOP and the C library's own numbers refuse with EINVAL,
+    // and are left as they are.
     for (int signal_number = 1; signal_number < NSIG; ++signal_number)
-        sigaction(signal_number, &default_action, nullptr);
+        if (sigaction(signal_number, &default_action, nullptr) == -1 && errno != EINVAL)
+            give_up(plan, launch_step::create, "sigaction");
     sigset_t empty;
     sigemptyset(&empty);
-    sigprocmask(SIG_SETMASK, &empty, nullptr);
+    if (sigprocmask(SIG_SETMASK, &empty, nullptr) == -1)
+        give_up(plan, launch_step::create, "sigprocmask");
 }
 
 // The raw system calls: glibc's wrappers of these would signal every thread
@@ -98,7 +100,7 @@ void keep_own_descriptors(child_plan& plan) {
 int become_child(void* argument) {
     child_plan& plan = *static_cast<child_plan*>(argument);
     const launch_request& request = *plan.request;
-    reset_signals();
+    reset_signals(plan);
     if (request.own_process_group && setpgid(0, 0) == -1)
         give_up(plan, launch_step::create, "setpgid");
     if (plan.user->change)
@@ -108,17 +110,6 @@ int become_child(void* argument) {
     keep_own_descriptors(plan);
     execve(request.executable.c_str(), plan.argv, plan.envp);
     give_up(plan, launch_step::create, "execve");
-}
-
-// The child's stack, made once: launches happen on one thread at a time.
-constexpr std::size_t child_stack_size = 64 * 1024;
-char* child_stack_top() {
-    static char* top = [] {
-        void* stack = mmap(nullptr, child_stack_size, PROT_READ | PROT_WRITE,
-                           MAP_PRIVATE | MAP_ANONYMOUS | MAP_STACK, -1, 0);
-        return stack == MAP_FAILED ? nullptr : static_cast<char*>(stack) + child_stack_size;
-    }();
-    return top;
 }
 
 // The service manager's socket is ours alone: a child that wrote to it
@@ -142,23 +133,33 @@ launch_result failed_launch(launch_step step, os_error error) {
 }
 
 launch_result clone_child(child_plan& plan) {
-    char* stack = child_stack_top();
+    child_registry& registry = child_registry::instance();
+    os_error stack_error;
+    char* stack = registry.child_stack(stack_error);
     if (stack == nullptr)
-        return failed_launch(launch_step::create, {ENOMEM, "mmap"});
+        return failed_launch(launch_step::create, stack_error);
     sigset_t all, saved;
     sigfillset(&all);
-    pthread_sigmask(SIG_SETMASK, &all, &saved);
-    // Noted before the guard goes: an orphan reap must never see it unnoted.
-    std::lock_guard<std::mutex> lock(supervised_guard);
+    if (int error = pthread_sigmask(SIG_SETMASK, &all, &saved))
+        return failed_launch(launch_step::create, {error, "pthread_sigmask"});
+    // Noted before the hold goes: an orphan reap must never see it unnoted.
+    std::unique_lock<std::mutex> held = registry.hold();
     int pidfd = -1;
     pid_t pid = clone(become_child, stack,
                       CLONE_VM | CLONE_FILES | CLONE_VFORK | CLONE_PIDFD | SIGCHLD, &plan, &pidfd);
     int clone_error = errno;
-    pthread_sigmask(SIG_SETMASK, &saved, nullptr);
+    int restore_error = pthread_sigmask(SIG_SETMASK, &saved, nullptr);
     if (pid == -1)
         return failed_launch(launch_step::create, {clone_error, "clone"});
+    // Our signals stay blocked: that launch fails, its child ended, unless it
+    // can't be ended, and then it is supervised as any other.
+    bool undo = restore_error != 0 && plan.failed_step == launch_step::none;
+    if (undo && syscall(SYS_pidfd_send_signal, pidfd, SIGKILL, nullptr, 0) == 0) {
+        plan.failed_step = launch_step::create;
+        plan.error = {restore_error, "pthread_sigmask"};
+    }
     if (plan.failed_step == launch_step::none) {
-        note_supervised(static_cast<int>(pid));
+        registry.note_supervised(static_cast<int>(pid), held);
         launch_result result;
         result.pid = static_cast<int>(pid);
         result.process.reset(pidfd);
@@ -167,102 +168,11 @@ launch_result clone_child(child_plan& plan) {
     // It has called _exit already; reap it so that no zombie stays behind.
     // Its pid was never noted, and the guard we hold keeps it from the orphans.
     siginfo_t info{};
-    waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED);
+    while (waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, WEXITED) == -1 &&
+           errno == EINTR) {
+    }
     close(pidfd);
     return failed_launch(plan.failed_step, plan.error);
-}
-
-// The low numbers where a launch puts what its child keeps, so that the child
-// need copy no more of our table than up to the last of them. They hold
-// /dev/null between launches, and null_fd always does. Taken on the first
-// launch, as low as were free then; launches come one at a time.
-struct low_slots {
-    int null_fd = -1;
-    int stdio[3] = {-1, -1, -1};
-    int ipc = -1;
-    int last = -1;
-};
-
-void release(low_slots& slots) {
-    for (int fd : {slots.null_fd, slots.stdio[0], slots.stdio[1], slots.stdio[2], slots.ipc})
-        if (fd != -1)
-            close(fd);
-    slots = {};
-}
-
-os_error reserve(low_slots& slots) {
-    if (slots.last != -1)
-        return {};
-    low_slots made;
-    made.null_fd = open("/dev/null", O_RDWR | O_CLOEXEC);
-    if (made.null_fd == -1)
-        return {errno, "open"};
-    made.last = made.null_fd;
-    for (int* slot : {&made.stdio[0], &made.stdio[1], &made.stdio[2], &made.ipc}) {
-        *slot = fcntl(made.null_fd, F_DUPFD_CLOEXEC, 3);
-        if (*slot == -1) {
-            os_error error{errno, "fcntl"};
-            release(made);
-            return error;
-        }
-        made.last = std::max(made.last, *slot);
-    }
-    slots = made;
-    return {};
-}
-
-// Puts the launch's descriptors into the slots and takes them out again: a
-// slot never holds a child's descriptor past its launch.
-class slot_filling {
-  public:
-    explicit slot_filling(low_slots& slots) : slots_(slots) {}
-    ~slot_filling() {
-        bool refilled = true;
-        for (int i = 0; i < filled_; ++i)
-            if (dup3(slots_.null_fd, used_[i], O_CLOEXEC) == -1)
-                refilled = false;
-        // A slot that kept a child's end would hold its pipe open: give them
-        // all up, and the next launch takes new ones.
-        if (!refilled)
-            release(slots_);
-    }
-    slot_filling(const slot_filling&) = delete;
-    slot_filling& operator=(const slot_filling&) = delete;
-
-    os_error fill(int fd, int slot) {
-        if (dup3(fd, slot, O_CLOEXEC) == -1)
-            return {errno, "dup3"};
-        used_[filled_++] = slot;
-        return {};
-    }
-
-  private:
-    low_slots& slots_;
-    int used_[4] = {};
-    int filled_ = 0;
-};
-
-low_slots slots;
-
-os_error place_descriptors(const launch_request& request, slot_filling& filling, child_plan& plan) {
-    for (int target = 0; target < 3; ++target) {
-        int& source = plan.stdio_sources[target];
-        source = request.stdio == stdio_source::handles ? request.stdio_handles[target]
-                 : request.stdio == stdio_source::none  ? slots.null_fd
-                                                        : target;
-        // Our own standard streams are low already.
-        if (request.stdio == stdio_source::handles && source > 2) {
-            if (os_error error = filling.fill(source, slots.stdio[target]))
-                return error;
-            source = slots.stdio[target];
-        }
-    }
-    if (request.ipc != no_handle) {
-        if (os_error error = filling.fill(request.ipc, slots.ipc))
-            return error;
-        plan.ipc_source = slots.ipc;
-    }
-    return {};
 }
 
 } // namespace
@@ -271,26 +181,38 @@ launch_result launch_child(const launch_request& request) {
     static_assert(sizeof(unsigned) == sizeof(gid_t));
     account user;
     if (!request.user.empty())
-        if (int refused = resolve_account(request.user, user))
-            return failed_launch(launch_step::logon, {refused, "resolve account"});
+        if (os_error refused = resolve_account(request.user, user))
+            return failed_launch(launch_step::logon, refused);
     std::vector<char*> argv;
     for (const auto& argument : request.argv)
         argv.push_back(const_cast<char*>(argument.c_str()));
     argv.push_back(nullptr);
     std::vector<char*> envp = child_environment();
-    if (os_error error = reserve(slots))
+    child_registry& registry = child_registry::instance();
+    // The slots are emptied once the launch is over, whatever its end.
+    struct refill_after {
+        child_registry& registry;
+        ~refill_after() { registry.refill(); }
+    } refill{registry};
+    placed_descriptors placed;
+    if (os_error error = registry.place(request, placed))
         return failed_launch(launch_step::create, error);
-    child_plan plan{&request, &user,      argv.data(),       envp.data(), {0, 1, 2},
-                    -1,       slots.last, launch_step::none, {}};
-    slot_filling filling(slots);
-    if (os_error error = place_descriptors(request, filling, plan))
-        return failed_launch(launch_step::create, error);
+    child_plan plan{&request,
+                    &user,
+                    argv.data(),
+                    envp.data(),
+                    {placed.stdio[0], placed.stdio[1], placed.stdio[2]},
+                    placed.ipc,
+                    placed.last_kept,
+                    launch_step::none,
+                    {}};
     return clone_child(plan);
 }
 
 exit_status exit_status_of(exit_watch& watch) {
     siginfo_t info{};
-    if (wait_supervised(watch.native_handle(), info, WEXITED | WNOHANG) == -1)
+    if (child_registry::instance().wait_supervised(watch.native_handle(), info,
+                                                   WEXITED | WNOHANG) == -1)
         return {true, false, 0, {errno, "waitid"}};
     if (info.si_pid == 0)
         return {};
@@ -313,8 +235,12 @@ bool continue_if_stopped(exit_watch& watch) {
     // WNOWAIT leaves the stop to be seen again: the next stop request asks
     // anew. Not through wait_supervised, which takes what it sees for an end.
     siginfo_t info{};
-    if (waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(watch.native_handle()), &info,
-               WSTOPPED | WNOHANG | WNOWAIT) == -1)
+    int waited;
+    do
+        waited = waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(watch.native_handle()),
+                        &info, WSTOPPED | WNOHANG | WNOWAIT);
+    while (waited == -1 && errno == EINTR);
+    if (waited == -1)
         return false;
     if (info.si_pid == 0 || info.si_code != CLD_STOPPED)
         return false;
@@ -326,10 +252,11 @@ bool continue_if_stopped(exit_watch& watch) {
 
 void end_now(owned_handle& process) {
     // A child we can't watch is one we never started as far as anyone knows:
-    // a failed kill leaves nothing better to do than reap what we can.
-    (void)signal_child(process.get(), SIGKILL);
+    // a failed kill leaves nothing better to do than reap what we can, without
+    // waiting for one that may run on.
+    int options = signal_child(process.get(), SIGKILL) ? WEXITED | WNOHANG : WEXITED;
     siginfo_t info{};
-    if (wait_supervised(process.get(), info, WEXITED) == -1)
+    if (child_registry::instance().wait_supervised(process.get(), info, options) == -1)
         info.si_pid = 0;
     process.reset();
 }

@@ -10,17 +10,12 @@
 #include <sys/prctl.h>
 #include <sys/signalfd.h>
 #include <unistd.h>
-#include <unordered_set>
 
 #include "platform/posix_children.hpp"
 
 namespace torvad::platform {
 
-std::mutex supervised_guard;
-
 namespace {
-std::unordered_set<int> supervised;
-
 // A scan for ended orphans walks all our children in the kernel, so it can't
 // follow every supervised child's end. A signal that names an orphan, or
 // comes while we have few children, is scanned for at once. Otherwise the
@@ -29,60 +24,42 @@ std::unordered_set<int> supervised;
 // into theirs, waits that long, and an end costs the same however many
 // children we have.
 constexpr std::size_t scan_share = 64;
-bool watching = false;
-bool scan_owed = false; // stays until a scan has seen no ended orphan
-// Supervised children reaped since the last scan, whose signal may come after
-// their exit wait has taken their status; and the signals that named them.
-std::unordered_set<int> reaped;
-std::size_t supervised_signals = 0;
+} // namespace
 
-// Drains the pending signals and says whether a scan is due.
-bool scan_due(int fd) {
+bool child_registry::scan_due(int fd) {
     signalfd_siginfo pending[8];
     ssize_t got;
     while ((got = read(fd, pending, sizeof pending)) > 0) {
         for (std::size_t i = 0; i < static_cast<std::size_t>(got) / sizeof pending[0]; ++i) {
             int pid = static_cast<int>(pending[i].ssi_pid);
-            if (supervised.count(pid) != 0 || reaped.count(pid) != 0)
-                ++supervised_signals;
+            if (supervised_.count(pid) != 0 || reaped_.count(pid) != 0)
+                ++supervised_signals_;
             else
-                scan_owed = true;
+                scan_owed_ = true;
         }
     }
     // Merged signals undercount the ends, and reaps come late: the larger.
-    std::size_t ends = std::max(supervised_signals, reaped.size());
-    if (ends != 0 && ends * scan_share >= supervised.size())
-        scan_owed = true;
-    return scan_owed;
+    std::size_t ends = std::max(supervised_signals_, reaped_.size());
+    if (ends != 0 && ends * scan_share >= supervised_.size())
+        scan_owed_ = true;
+    return scan_owed_;
 }
 
-void scan_done() {
-    scan_owed = false;
-    reaped.clear();
-    supervised_signals = 0;
-}
-} // namespace
-
-void note_supervised(int pid) {
-    supervised.insert(pid);
-    reaped.erase(pid);
-}
-
-int wait_supervised(int pidfd, siginfo_t& info, int options) {
-    int waited;
-    do
-        waited = waitid(static_cast<idtype_t>(P_PIDFD), static_cast<id_t>(pidfd), &info, options);
-    while (waited == -1 && errno == EINTR);
-    if (waited == 0 && info.si_pid != 0) {
-        std::lock_guard<std::mutex> lock(supervised_guard);
-        supervised.erase(info.si_pid);
-        if (watching)
-            reaped.insert(info.si_pid);
-    }
-    return waited;
+void child_registry::scan_done() {
+    scan_owed_ = false;
+    reaped_.clear();
+    supervised_signals_ = 0;
 }
 
 os_error watch_orphans(stream& watch) {
+    return child_registry::instance().watch_orphans(watch);
+}
+
+bool reap_orphans(stream& watch) {
+    return child_registry::instance().reap_orphans(watch);
+}
+
+os_error child_registry::watch_orphans(stream& watch) {
     // The first process of a PID namespace is the reaper there already.
     if (getpid() != 1 && prctl(PR_SET_CHILD_SUBREAPER, 1) == -1)
         return {errno, "prctl"};
@@ -101,12 +78,12 @@ os_error watch_orphans(stream& watch) {
     if (failure)
         return {failure.value(), "assign"};
     fd.release();
-    watching = true;
+    watching_ = true;
     return {};
 }
 
-bool reap_orphans(stream& watch) {
-    std::lock_guard<std::mutex> lock(supervised_guard);
+bool child_registry::reap_orphans(stream& watch) {
+    std::lock_guard<std::mutex> lock(guard_);
     // One pending signal stands for any number of ends; the scan below finds them.
     if (!scan_due(watch.native_handle()))
         return true;
@@ -121,7 +98,7 @@ bool reap_orphans(stream& watch) {
         }
         // The peek shows one ended child only, and the same one until it is
         // reaped: the rest can be seen once this one's pidfd has served.
-        if (supervised.count(ended.si_pid) != 0)
+        if (supervised_.count(ended.si_pid) != 0)
             return false;
         siginfo_t taken{};
         while (waitid(P_PID, static_cast<id_t>(ended.si_pid), &taken, WEXITED | WNOHANG) == -1 &&

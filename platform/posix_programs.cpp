@@ -23,7 +23,9 @@ using output_handler = std::function<void(const char*, std::size_t)>;
 // Once the program has ended, what it wrote is in the pipe: take that and stop,
 // rather than wait for an end of file that a grandchild may never give.
 void drain(int source, const output_handler& on_output) {
-    fcntl(source, F_SETFL, O_NONBLOCK);
+    // A blocking read here would wait for that grandchild: rather take nothing.
+    if (fcntl(source, F_SETFL, O_NONBLOCK) == -1)
+        return;
     char buffer[4096];
     ssize_t got;
     while ((got = read(source, buffer, sizeof buffer)) > 0 || (got == -1 && errno == EINTR))
@@ -57,7 +59,7 @@ void relay_until_end(int source, int pidfd, const output_handler& on_output) {
 
 int wait_for_exit_code(int pidfd) {
     siginfo_t info{};
-    if (wait_supervised(pidfd, info, WEXITED) == -1)
+    if (child_registry::instance().wait_supervised(pidfd, info, WEXITED) == -1)
         return -1;
     return info.si_code == CLD_EXITED ? info.si_status
                                       : static_cast<int>(signal_status(info.si_status));

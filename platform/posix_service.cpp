@@ -24,11 +24,13 @@ namespace {
 constexpr int service_ended_signal = SIGUSR2;
 } // namespace
 
-void hold_stop_requests() {
+os_error hold_stop_requests() {
     sigset_t stop;
     sigemptyset(&stop);
     sigaddset(&stop, SIGTERM);
-    pthread_sigmask(SIG_BLOCK, &stop, nullptr);
+    if (int error = pthread_sigmask(SIG_BLOCK, &stop, nullptr))
+        return {error, "pthread_sigmask"};
+    return {};
 }
 
 // The manager knows us by the unit, not by a name we give.
@@ -40,8 +42,10 @@ bool run_service_dispatcher(const std::string& /*name*/, const std::function<voi
     sigemptyset(&waited);
     sigaddset(&waited, SIGTERM);
     sigaddset(&waited, service_ended_signal);
-    // Blocked before the thread starts, so both threads leave these to sigwait.
-    pthread_sigmask(SIG_BLOCK, &waited, nullptr);
+    // Blocked before the thread starts, so both threads leave these to sigwait;
+    // unblocked, the stop would end us by its default action: no service then.
+    if (pthread_sigmask(SIG_BLOCK, &waited, nullptr) != 0)
+        return false;
     std::atomic<bool> service_ended = false;
     pthread_t first_thread = pthread_self();
     std::thread service;
@@ -49,7 +53,10 @@ bool run_service_dispatcher(const std::string& /*name*/, const std::function<voi
         service = std::thread([&] {
             service_main();
             service_ended = true;
-            pthread_kill(first_thread, service_ended_signal);
+            // Sent to the process instead, it waits, blocked, for the sigwait.
+            if (pthread_kill(first_thread, service_ended_signal) != 0 &&
+                kill(getpid(), service_ended_signal) == -1)
+                std::abort(); // nothing else could wake the first thread
         });
     } catch (const std::system_error&) {
         // No thread, no service: as if the manager had not started us.

@@ -46,6 +46,10 @@ os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed) {
     return {};
 }
 
+int taken_pipe_names() {
+    return 0;
+}
+
 os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) {
     int ends[2];
     if (pipe2(ends, O_CLOEXEC) == -1)
@@ -62,9 +66,10 @@ os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) 
 }
 
 os_error attach_pipe(stream& ours, std::int64_t value) {
-    int fd = static_cast<int>(value);
-    if (value < 0 || value != fd || fcntl(fd, F_GETFD) == -1)
-        return {EBADF, "fcntl"};
+    // A value that is no descriptor number is asked as -1, which none is.
+    int fd = value < 0 || value != static_cast<int>(value) ? -1 : static_cast<int>(value);
+    if (fcntl(fd, F_GETFD) == -1)
+        return {errno, "fcntl"};
     owned_handle given(fd);
     os_error error = bind(ours, given);
     // A descriptor that was given to us stays open, whatever we could do with it.
@@ -81,10 +86,8 @@ boost::system::error_code take_output(stream& pipe, output_buffer&, const char*&
 }
 
 // Readiness moves no bytes: nothing is ever on its way.
-bool output_in_flight(const output_buffer&) {
-    return false;
+bool end_output(stream&, output_buffer&) {
+    return true;
 }
-
-void cut_output_short(stream&) {}
 
 } // namespace torvad::platform

@@ -18,7 +18,8 @@ std::string describe(const os_error& error) {
     return std::string(error.call) + ": " + std::strerror(error.code);
 }
 
-void prepare_own_process() {
+os_error prepare_own_process() {
+    os_error first;
     for (int fd = 0; fd < 3; ++fd) {
         if (fcntl(fd, F_GETFD) != -1)
             continue;
@@ -29,11 +30,15 @@ void prepare_own_process() {
     }
     // An inherited SIGCHLD ignore would have the kernel reap our children
     // before we could read how they ended.
-    signal(SIGCHLD, SIG_DFL);
-    signal(SIGPIPE, SIG_IGN);
+    if (signal(SIGCHLD, SIG_DFL) == SIG_ERR)
+        first = {errno, "signal"};
+    if (signal(SIGPIPE, SIG_IGN) == SIG_ERR && !first)
+        first = {errno, "signal"};
     sigset_t none;
     sigemptyset(&none);
-    sigprocmask(SIG_SETMASK, &none, nullptr);
+    if (sigprocmask(SIG_SETMASK, &none, nullptr) == -1 && !first)
+        first = {errno, "sigprocmask"};
+    return first;
 }
 
 int current_process_id() {
@@ -61,7 +66,9 @@ bool change_directory(const std::string& path) {
 std::tm local_time_now() {
     std::time_t now = std::time(nullptr);
     std::tm local{};
-    localtime_r(&now, &local);
+    // A time that can't be broken down is stamped with zeros.
+    if (localtime_r(&now, &local) == nullptr)
+        return {};
     return local;
 }
 

@@ -1,5 +1,5 @@
 // Launching, watching and ending children on Windows: a logon for another
-// account, CreateProcessAsUserA with a command line that gives back exactly
+// account, CreateProcessAsUserW with a command line that gives back exactly
 // the items asked for, the handles the child is to have and no others, and
 // the process handle as what tells the child's end.
 #include <windows.h>
@@ -7,7 +7,7 @@
 #include <userenv.h>
 
 #include <algorithm>
-#include <cctype>
+#include <cwctype>
 #include <memory>
 
 #include "platform/platform.hpp"
@@ -23,48 +23,85 @@ launch_result failed_launch(launch_step step, const char* call) {
     return result;
 }
 
+// Text of the system's code page in UTF-16, whole or not at all: a byte that
+// is no character there is refused rather than guessed at.
+bool to_wide(const std::string& text, std::wstring& wide) {
+    wide.clear();
+    if (text.empty())
+        return true;
+    int size = MultiByteToWideChar(CP_ACP, MB_ERR_INVALID_CHARS, text.data(),
+                                   static_cast<int>(text.size()), nullptr, 0);
+    if (size == 0)
+        return false;
+    wide.resize(static_cast<std::size_t>(size));
+    return MultiByteToWideChar(CP_ACP, MB_ERR_INVALID_CHARS, text.data(),
+                               static_cast<int>(text.size()), wide.data(), size) == size;
+}
+
 // One item as the C runtime reads it back whole: in double quotes, a quote
 // behind a backslash, and a run of backslashes doubled where it stands before
 // a quote or the closing quote. The item's bytes are permitted as they are;
 // were a backslash left single there, it would end the item early and let
-// the rest of it pass as arguments nobody permitted.
-void append_item(std::string& line, const std::string& item) {
-    line += '"';
+// the rest of it pass as arguments nobody permitted. The quoting counts
+// characters, never bytes: on a double-byte code page the second byte of a
+// character may be a backslash that the child never sees as one.
+void append_item(std::wstring& line, const std::wstring& item) {
+    line += L'"';
     std::size_t backslashes = 0;
-    for (char c : item) {
-        if (c == '\\') {
+    for (wchar_t c : item) {
+        if (c == L'\\') {
             ++backslashes;
             continue;
         }
-        line.append(c == '"' ? 2 * backslashes + 1 : backslashes, '\\');
+        line.append(c == L'"' ? 2 * backslashes + 1 : backslashes, L'\\');
         line += c;
         backslashes = 0;
     }
-    line.append(2 * backslashes, '\\');
-    line += '"';
+    line.append(2 * backslashes, L'\\');
+    line += L'"';
 }
 
 // The runtime reads the program's name up to its closing quote, without
-// escapes; it is an absolute path, which can hold no quote.
-std::string command_line_of(const std::vector<std::string>& argv) {
-    std::string line = '"' + argv[0] + '"';
+// escapes; it is an absolute path, which can hold no quote. False when an
+// item is no text of the system's code page.
+bool command_line_of(const std::vector<std::string>& argv, std::wstring& line) {
+    std::wstring item;
+    if (!to_wide(argv[0], item))
+        return false;
+    line = L'"' + item + L'"';
     for (std::size_t i = 1; i < argv.size(); ++i) {
-        line += ' ';
-        append_item(line, argv[i]);
+        if (!to_wide(argv[i], item))
+            return false;
+        line += L' ';
+        append_item(line, item);
     }
-    return line;
+    return true;
+}
+
+bool has_batch_extension(std::wstring name) {
+    name.erase(name.find_last_not_of(L". ") + 1);
+    std::wstring extension = name.size() >= 4 ? name.substr(name.size() - 4) : std::wstring();
+    std::transform(extension.begin(), extension.end(), extension.begin(),
+                   [](wchar_t c) { return static_cast<wchar_t>(std::towlower(c)); });
+    return extension == L".bat" || extension == L".cmd";
 }
 
 // Windows runs a batch file through cmd.exe, whose reading of a command line
 // no quoting makes safe (% and ! expand even within quotes): such a program
-// is refused rather than handed text that could run something else. The
-// name is taken as the file system takes it, trailing dots and blanks gone.
-bool is_batch_file(const std::string& path) {
-    std::string name = path.substr(0, path.find_last_not_of(". ") + 1);
-    std::string extension = name.size() >= 4 ? name.substr(name.size() - 4) : std::string();
-    std::transform(extension.begin(), extension.end(), extension.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
-    return extension == ".bat" || extension == ".cmd";
+// is refused rather than handed text that could run something else. The name
+// is taken as the file system takes it: a stream named behind a colon beyond
+// the drive ("x.bat::$DATA") is the file itself, trailing dots and blanks
+// go, and a short name stands for the long one.
+bool is_batch_file(const std::wstring& path) {
+    std::size_t drive = path.starts_with(L"\\\\?\\") || path.starts_with(L"\\\\.\\") ? 4 : 0;
+    if (path.size() > drive + 1 && path[drive + 1] == L':')
+        drive += 2;
+    std::wstring file = path.substr(0, path.find(L':', drive));
+    std::wstring long_name(32768, L'\0');
+    DWORD size =
+        GetLongPathNameW(file.c_str(), long_name.data(), static_cast<DWORD>(long_name.size()));
+    long_name.resize(size < long_name.size() ? size : 0);
+    return has_batch_extension(file) || has_batch_extension(long_name);
 }
 
 bool log_on(const std::string& user, owned_handle& token) {
@@ -80,7 +117,7 @@ bool log_on(const std::string& user, owned_handle& token) {
 
 // No child opens a visible window; its standard handles are ours, the pipes'
 // child ends, or none at all.
-void set_standard_handles(const launch_request& request, STARTUPINFOA& start) {
+void set_standard_handles(const launch_request& request, STARTUPINFOW& start) {
     start.dwFlags = STARTF_USESHOWWINDOW;
     start.wShowWindow = SW_HIDE;
     if (request.stdio == stdio_source::none)
@@ -100,7 +137,7 @@ void set_standard_handles(const launch_request& request, STARTUPINFOA& start) {
 // What the child inherits, each once: the pipes' child ends and its ipc end,
 // made inheritable here, and those of our own standard handles that are
 // inheritable already (a console's may not be real handles at all).
-std::vector<HANDLE> inherited_handles(const launch_request& request, const STARTUPINFOA& start,
+std::vector<HANDLE> inherited_handles(const launch_request& request, const STARTUPINFOW& start,
                                       os_error& error) {
     std::vector<HANDLE> handles;
     bool ours = request.stdio == stdio_source::inherit;
@@ -163,14 +200,19 @@ struct environment_block {
 } // namespace
 
 launch_result launch_child(const launch_request& request) {
-    if (is_batch_file(request.executable)) {
+    std::wstring executable, directory, command_line;
+    if (!to_wide(request.executable, executable) ||
+        !to_wide(request.working_directory, directory) ||
+        !command_line_of(request.argv, command_line))
+        return failed_launch(launch_step::unconvertible, "MultiByteToWideChar");
+    if (is_batch_file(executable)) {
         SetLastError(ERROR_BAD_EXE_FORMAT);
         return failed_launch(launch_step::refused, "batch file");
     }
     owned_handle token;
     if (!request.user.empty() && !log_on(request.user, token))
         return failed_launch(launch_step::logon, "LogonUserA");
-    STARTUPINFOEXA start{};
+    STARTUPINFOEXW start{};
     set_standard_handles(request, start.StartupInfo);
     os_error error;
     std::vector<HANDLE> handles = inherited_handles(request, start.StartupInfo, error);
@@ -188,23 +230,23 @@ launch_result launch_child(const launch_request& request) {
     // of its own starts with it switched off, and ends through its sigterm.
     if (request.own_process_group)
         flags |= CREATE_NEW_PROCESS_GROUP;
+    // Our own account's child inherits our environment, which the system
+    // keeps in UTF-16; another account gets its own, also in UTF-16, and its
+    // own desktop, not ours.
     environment_block environment;
-    // Another account gets its own desktop, not ours, and its own environment.
-    char own_desktop[] = "";
+    wchar_t own_desktop[] = L"";
     if (token.valid()) {
         start.StartupInfo.lpDesktop = own_desktop;
         flags |= CREATE_UNICODE_ENVIRONMENT;
         if (!CreateEnvironmentBlock(&environment.block, token.get(), FALSE))
             return failed_launch(launch_step::create, "CreateEnvironmentBlock");
     }
-    std::string command_line = command_line_of(request.argv);
     PROCESS_INFORMATION created{};
-    if (!CreateProcessAsUserA(token.get(), request.executable.c_str(), command_line.data(), nullptr,
+    if (!CreateProcessAsUserW(token.get(), executable.c_str(), command_line.data(), nullptr,
                               nullptr, !handles.empty(), flags, environment.block,
-                              request.working_directory.empty() ? nullptr
-                                                                : request.working_directory.c_str(),
-                              &start.StartupInfo, &created))
-        return failed_launch(launch_step::create, "CreateProcessAsUserA");
+                              directory.empty() ? nullptr : directory.c_str(), &start.StartupInfo,
+                              &created))
+        return failed_launch(launch_step::create, "CreateProcessAsUserW");
     CloseHandle(created.hThread);
     launch_result result;
     result.pid = static_cast<int>(created.dwProcessId);

@@ -32,7 +32,9 @@ void WINAPI service_main(DWORD, LPSTR*) {
 } // namespace
 
 // No signal can stop a service: its stop comes as a control.
-void hold_stop_requests() {}
+os_error hold_stop_requests() {
+    return {};
+}
 
 bool run_service_dispatcher(const std::string& name, const std::function<void()>& body,
                             const std::function<void()>& on_stop) {

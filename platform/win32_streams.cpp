@@ -3,10 +3,12 @@
 // stream's own buffer.
 #include <windows.h>
 
+#include <bcrypt.h>
 #include <sddl.h>
 
 #include <algorithm>
 #include <memory>
+#include <utility>
 
 #include <boost/asio/buffer.hpp>
 #include <boost/asio/error.hpp>
@@ -17,17 +19,24 @@ namespace torvad::platform {
 
 namespace {
 
-// The number in the name of each ipc pipe; the relayed streams count apart.
-std::uint64_t ipc_pipe_counter = 0;
-std::uint64_t relay_pipe_counter = 0;
-
-std::string pipe_name(const char* kind, std::uint64_t number) {
-    return std::string("\\\\.\\pipe\\torvad_") + kind + std::to_string(GetCurrentProcessId()) +
-           "_" + std::to_string(number);
-}
-
 os_error last_error(const char* call) {
     return {static_cast<int>(GetLastError()), call};
+}
+
+// A name nobody can tell in advance, 128 bits from the system's generator: a
+// counted one could be read off a child's own handles and the next taken
+// first, by the child or by another account.
+os_error random_pipe_name(std::string& name) {
+    unsigned char bytes[16];
+    if (!BCRYPT_SUCCESS(
+            BCryptGenRandom(nullptr, bytes, sizeof bytes, BCRYPT_USE_SYSTEM_PREFERRED_RNG)))
+        return {ERROR_GEN_FAILURE, "BCryptGenRandom"};
+    name = "\\\\.\\pipe\\torvad_";
+    for (unsigned char byte : bytes) {
+        name += "0123456789abcdef"[byte >> 4];
+        name += "0123456789abcdef"[byte & 15];
+    }
+    return {};
 }
 
 // A descriptor whose one list admits our own account and the system, and
@@ -63,24 +72,29 @@ os_error bind(stream& ours, owned_handle& handle) {
 }
 
 const char* const name_taken = "CreateNamedPipeA, its name taken by another program";
+const char* const connected_elsewhere = "CreateFileA, connected to another program's pipe";
+int taken_names = 0; // since taken_pipe_names last told them
 
 // One instance of the pipe name, ours bound to the loop, theirs opened on it,
-// which connects the pipe. The names can be guessed, so each pipe is made
-// ours alone rather than left open to any local user: a name somebody took
-// first fails, only our own account and the system, on this machine, may
-// connect, and the server may identify the opener but never act as it.
-// Theirs is not inheritable: the launch that hands it on makes it so. Where
-// the ends may read (duplex), the instances and the server are checked too:
-// the check needs that access.
-os_error make_pipe(const std::string& name, DWORD open_mode, DWORD pipe_mode, DWORD buffer_size,
-                   stream& ours, DWORD their_access, DWORD their_flags, owned_handle& theirs,
-                   pipe_step& failed, bool duplex) {
+// which connects the pipe. Each pipe is made ours alone rather than left open
+// to any local user: a name somebody took first fails, only our own account
+// and the system, on this machine, may connect, and the server may identify
+// the opener but never act as it. Where the first-instance flag is not
+// enforced (Wine), ours may have joined the instances of somebody else's
+// pipe, and the open could connect to one of theirs: so the instances are
+// counted (which takes read access: our end is always duplex) and the
+// opened end must lead back to us. Theirs is not inheritable: the launch
+// that hands it on makes it so.
+os_error make_pipe_named(const std::string& name, DWORD open_mode, DWORD pipe_mode,
+                         DWORD buffer_size, stream& ours, DWORD their_access, DWORD their_flags,
+                         owned_handle& theirs, pipe_step& failed) {
     failed = pipe_step::create;
     std::shared_ptr<void> descriptor;
     if (os_error error = own_account_only(descriptor))
         return error;
     SECURITY_ATTRIBUTES ours_alone{sizeof ours_alone, descriptor.get(), FALSE};
-    HANDLE made = CreateNamedPipeA(name.c_str(), open_mode | FILE_FLAG_FIRST_PIPE_INSTANCE,
+    HANDLE made = CreateNamedPipeA(name.c_str(),
+                                   PIPE_ACCESS_DUPLEX | open_mode | FILE_FLAG_FIRST_PIPE_INSTANCE,
                                    pipe_mode | PIPE_WAIT | PIPE_REJECT_REMOTE_CLIENTS, 1,
                                    buffer_size, buffer_size, 0, &ours_alone);
     if (made == INVALID_HANDLE_VALUE && GetLastError() == ERROR_ACCESS_DENIED)
@@ -88,12 +102,8 @@ os_error make_pipe(const std::string& name, DWORD open_mode, DWORD pipe_mode, DW
     if (made == INVALID_HANDLE_VALUE)
         return last_error("CreateNamedPipeA");
     owned_handle server(made);
-    // Where the first-instance flag is not enforced (Wine), ours may have
-    // joined the instances of somebody else's pipe, and the open below could
-    // connect to one of theirs.
-    DWORD instances = 1;
-    if (duplex &&
-        !GetNamedPipeHandleStateA(made, nullptr, &instances, nullptr, nullptr, nullptr, 0))
+    DWORD instances = 0;
+    if (!GetNamedPipeHandleStateA(made, nullptr, &instances, nullptr, nullptr, nullptr, 0))
         return last_error("GetNamedPipeHandleStateA");
     if (instances != 1)
         return {ERROR_ACCESS_DENIED, name_taken};
@@ -106,39 +116,63 @@ os_error make_pipe(const std::string& name, DWORD open_mode, DWORD pipe_mode, DW
     if (client == INVALID_HANDLE_VALUE)
         return last_error("CreateFileA");
     owned_handle opened(client);
-    ULONG server_id = GetCurrentProcessId();
-    if (duplex && !GetNamedPipeServerProcessId(client, &server_id))
+    ULONG server_id = 0;
+    if (!GetNamedPipeServerProcessId(client, &server_id))
         return last_error("GetNamedPipeServerProcessId");
     if (server_id != GetCurrentProcessId())
-        return {ERROR_ACCESS_DENIED, "CreateFileA, connected to another program's pipe"};
+        return {ERROR_ACCESS_DENIED, connected_elsewhere};
     theirs = std::move(opened);
     failed = pipe_step::none;
     return {};
 }
 
+// A name found taken is tried again under a fresh one, so that a squatter
+// who guessed a name can't keep a launch from succeeding; with random names
+// a second guess is as unlikely as the first, and a few tries are plenty.
+constexpr int name_tries = 4;
+
+os_error make_pipe(DWORD open_mode, DWORD pipe_mode, DWORD buffer_size, stream& ours,
+                   DWORD their_access, DWORD their_flags, owned_handle& theirs, pipe_step& failed) {
+    os_error error;
+    for (int attempt = 0; attempt < name_tries; ++attempt) {
+        std::string name;
+        if ((error = random_pipe_name(name))) {
+            failed = pipe_step::create;
+            return error;
+        }
+        error = make_pipe_named(name, open_mode, pipe_mode, buffer_size, ours, their_access,
+                                their_flags, theirs, failed);
+        if (error.call != name_taken && error.call != connected_elsewhere)
+            return error;
+        ++taken_names;
+        boost::system::error_code ignored;
+        ours.close(ignored);
+    }
+    return error;
+}
+
 } // namespace
 
 os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed) {
-    std::string name = pipe_name("", ipc_pipe_counter++);
-    return make_pipe(name, PIPE_ACCESS_DUPLEX | FILE_FLAG_OVERLAPPED,
-                     PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE, 8192, ours,
-                     GENERIC_READ | GENERIC_WRITE, FILE_FLAG_OVERLAPPED, theirs, failed, true);
+    return make_pipe(FILE_FLAG_OVERLAPPED, PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE, 8192, ours,
+                     GENERIC_READ | GENERIC_WRITE, FILE_FLAG_OVERLAPPED, theirs, failed);
 }
 
 // Our end overlapped for the loop; the child's end plain, as a program's
-// standard handles are.
+// standard handles are, and one way only.
 os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) {
-    bool child_reads = stream_number == 0;
-    std::string name = pipe_name("stdio_", relay_pipe_counter++);
-    DWORD direction = child_reads ? PIPE_ACCESS_OUTBOUND : PIPE_ACCESS_INBOUND;
     pipe_step failed = pipe_step::none;
-    os_error error = make_pipe(
-        name, direction | FILE_FLAG_OVERLAPPED, PIPE_TYPE_BYTE | PIPE_READMODE_BYTE, 65536, ours,
-        child_reads ? GENERIC_READ : GENERIC_WRITE, 0, theirs, failed, false);
+    os_error error =
+        make_pipe(FILE_FLAG_OVERLAPPED, PIPE_TYPE_BYTE | PIPE_READMODE_BYTE, 65536, ours,
+                  stream_number == 0 ? GENERIC_READ : GENERIC_WRITE, 0, theirs, failed);
     boost::system::error_code ignored;
     if (failed == pipe_step::open)
         ours.close(ignored);
     return error;
+}
+
+int taken_pipe_names() {
+    return std::exchange(taken_names, 0);
 }
 
 os_error attach_pipe(stream& ours, std::int64_t value) {
@@ -180,14 +214,14 @@ boost::system::error_code take_output(stream& pipe, output_buffer& buffer, const
     return error;
 }
 
-bool output_in_flight(const output_buffer& buffer) {
-    return buffer.reading;
-}
-
-// The read completes at once: with what it had already read, or with nothing.
-void cut_output_short(stream& pipe) {
+// A read on its way completes at once: with what it had already read, or
+// with nothing.
+bool end_output(stream& pipe, output_buffer& buffer) {
+    if (!buffer.reading)
+        return true;
     boost::system::error_code ignored;
     pipe.cancel(ignored);
+    return false;
 }
 
 } // namespace torvad::platform

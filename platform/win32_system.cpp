@@ -30,16 +30,20 @@ std::string describe(const os_error& error) {
 namespace {
 
 // The runtime turns the console's Ctrl-C into SIGINT, which the loop waits
-// for; Ctrl-Break and the closing of the console would end us at once,
-// without a sigterm to any child and with the PID file left behind. They are
-// made the same SIGINT. The close ends us when this returns, so it waits
-// here, within the few seconds Windows grants, while the loop stops the
-// children and the program returns.
+// for; Ctrl-Break, the closing of the console and the system's shutdown
+// would end us at once, without a sigterm to any child and with the PID file
+// left behind. They are made the same SIGINT. The close and the shutdown end
+// us when this returns, so it waits here, within the few seconds Windows
+// grants, while the loop stops the children and the program returns. A
+// logoff ends a user's session, not a service's: it is ignored, as a
+// service must, or the default handler would end us with the session.
 BOOL WINAPI stop_on_console_event(DWORD event) {
-    if (event != CTRL_BREAK_EVENT && event != CTRL_CLOSE_EVENT)
+    if (event == CTRL_LOGOFF_EVENT)
+        return TRUE;
+    if (event != CTRL_BREAK_EVENT && event != CTRL_CLOSE_EVENT && event != CTRL_SHUTDOWN_EVENT)
         return FALSE;
     std::raise(SIGINT);
-    if (event == CTRL_CLOSE_EVENT)
+    if (event != CTRL_BREAK_EVENT)
         Sleep(INFINITE);
     return TRUE;
 }
@@ -49,9 +53,11 @@ BOOL WINAPI stop_on_console_event(DWORD event) {
 // Windows starts us as we are: standard handles that are missing stay null,
 // and a child's end is seen on its process handle, not by a signal. Whichever
 // console handler is asked first, the runtime's takes Ctrl-C alone. Without
-// ours (there is no log yet to say so), those events end us as before.
-void prepare_own_process() {
-    SetConsoleCtrlHandler(stop_on_console_event, TRUE);
+// ours, those events end us as before, and -v says why.
+os_error prepare_own_process() {
+    if (!SetConsoleCtrlHandler(stop_on_console_event, TRUE))
+        return {static_cast<int>(GetLastError()), "SetConsoleCtrlHandler"};
+    return {};
 }
 
 void unbuffer_output() {

@@ -1,24 +1,26 @@
 // Execute requests: the decision is the protocol's; making the channel and
-// keeping its id is ours.
-#include "process/process.hpp"
+// keeping its id is the link's.
+#include "process/ipc_link.hpp"
 
 #include "matcher/bounded_regex.hpp"
+#include "process/process.hpp"
 
 namespace torvad {
 
-void process::send_and_forget(std::uint32_t channel_id, std::uint32_t type, std::uint32_t flags) {
-    send_packet(channel_id, type, flags, nullptr, 0);
-    link_.channels.erase(channel_id);
+void ipc_link::send_and_forget(std::uint32_t channel, std::uint32_t type, std::uint32_t flags) {
+    send(channel, type, flags, nullptr, 0);
+    channels_.erase(channel);
 }
 
-void process::handle_execute(const packet_header& header, const char* payload) {
-    if (link_.channels.count(header.channel) != 0) {
+void ipc_link::execute(const packet_header& header, const char* payload) {
+    process_owner& owner = self_.owner;
+    if (channels_.count(header.channel) != 0) {
         owner.log_error("channel 0x%x already exists", header.channel);
         return;
     }
-    execute_decision decision =
-        decide_execute(header.flags, payload, header.length - packet_header_size, user,
-                       working_directory, owner.patterns(), platform::thread_cpu_nanoseconds);
+    execute_decision decision = decide_execute(
+        header.flags, payload, header.length - packet_header_size, self_.what.user,
+        self_.what.working_directory, owner.patterns(), platform::thread_cpu_nanoseconds);
     if (decision.refusal != nullptr) {
         if (decision.undecided)
             owner.log_error("a pattern could not be matched within %d ms; refused",
@@ -27,10 +29,11 @@ void process::handle_execute(const packet_header& header, const char* payload) {
         send_and_forget(header.channel, packet_failed, decision.status);
         return;
     }
-    auto created = create(owner, std::move(decision.request), {weak_from_this(), header.channel});
+    auto created = process::create(owner, std::move(decision.request),
+                                   {self_.weak_from_this(), header.channel});
     // The entry is there before start, so that a failed start, which sends
     // failed at once, also frees the id at once.
-    link_.channels[header.channel] = created;
+    channels_[header.channel] = created;
     created->start();
 }
 

@@ -1,7 +1,5 @@
-// Making, attaching and closing an ipc pipe, and its queue's bookkeeping.
+// Making, attaching and closing an ipc pipe, and a channel leaving it.
 #include "process/ipc_link.hpp"
-
-#include <utility>
 
 namespace torvad {
 
@@ -14,8 +12,10 @@ platform::os_error ipc_link::make(platform::owned_handle& theirs, platform::pipe
 
 platform::os_error ipc_link::attach(std::int64_t handle_value) {
     platform::os_error error = platform::attach_pipe(pipe_, handle_value);
-    if (!error)
+    if (!error) {
         in_ = std::make_unique<framer>();
+        attached_ = true;
+    }
     return error;
 }
 
@@ -23,26 +23,12 @@ void ipc_link::close() {
     boost::system::error_code ignored;
     pipe_.close(ignored);
     out_.clear();
-    channels.clear();
+    channels_.clear();
 }
 
-bool ipc_link::resume_reads() {
-    if (!read_paused_ || !pipe_.is_open() || backlogged_channels_ != 0)
-        return false;
-    read_paused_ = false;
-    return true;
-}
-
-bool ipc_link::queue_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                            const void* data, std::uint32_t size) {
-    out_.push_packet(channel, type, flags, data, size);
-    return !writing_;
-}
-
-std::vector<std::weak_ptr<process>> ipc_link::take_roomed_writers() {
-    if (out_.size() >= ipc_low_mark)
-        return {};
-    return std::exchange(waiting_, {});
+void ipc_link::leave(std::uint32_t id, process* channel) {
+    channels_.erase(id);
+    own_channels_.erase(channel);
 }
 
 } // namespace torvad

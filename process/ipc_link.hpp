@@ -1,7 +1,8 @@
 // The ipc pipe of a persistent child: the pipe, the framer of what comes in,
-// the queue of what goes out, and the channels it carries. A part of its
-// process, which keeps it alive for its reads and writes and routes what the
-// packets ask for.
+// the queue of what goes out, and the channels it carries, to which it routes
+// what the packets ask for. A part of its process: its reads and writes hold
+// the process alive, and a peer closing an attached pipe is reported to the
+// process's life.
 #pragma once
 
 #include <cstdint>
@@ -19,76 +20,89 @@ namespace torvad {
 
 class process;
 
-class ipc_link {
+// What a channel needs of its requester's link: its packets go out there, its
+// output waits there for room in the queue, and its stdin backlog holds back
+// the link's reads. A channel is one of the link's from its construction to
+// its leave.
+class requester_link {
   public:
-    explicit ipc_link(boost::asio::io_context& loop) : pipe_(loop) {}
+    // Queues one packet (traced under -v) and writes it; a closed pipe takes nothing.
+    virtual void send(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                      const void* data, std::uint32_t size) = 0;
+    // The queue is over its mark: a channel's output waits for room.
+    virtual bool backlogged() const = 0;
+    // writer's output is resumed once the queue is below its low mark.
+    virtual void wait_for_room(std::weak_ptr<process> writer) = 0;
+    // A channel's stdin queue went over its mark (true) or back under it.
+    virtual void count_backlogged_channel(bool backlogged) = 0;
+    // A channel's stdin has room again: reads go on unless another holds them.
+    virtual void resume_reads() = 0;
+    virtual void join(process* channel) = 0;
+    // The channel's end: its id is free, and it is no longer ours.
+    virtual void leave(std::uint32_t id, process* channel) = 0;
+
+  protected:
+    ~requester_link() = default;
+};
+
+class ipc_link final : public requester_link {
+  public:
+    ipc_link(process& self, boost::asio::io_context& loop) : self_(self), pipe_(loop) {}
 
     // A new pipe, theirs for the child; or one another program made.
     platform::os_error make(platform::owned_handle& theirs, platform::pipe_step& failed);
     platform::os_error attach(std::int64_t handle_value);
     bool open() const { return pipe_.is_open(); }
+    // Reads the pipe from now on, and sends the version packet.
+    void start();
     // Ends the pending read and write before the queue goes; channels are forgotten.
     void close();
+    // Closes the relayed pipes of every channel not yet ended, a restarted one
+    // included: their output has nowhere to go.
+    void close_channel_pipes();
 
-    // --- in: a read at a time into the framer ---
-    template <class Read> void read(Read&& handler) {
-        pipe_.async_read_some(boost::asio::buffer(in_->free_space(), in_->free_size()),
-                              std::forward<Read>(handler));
+    void send(std::uint32_t channel, std::uint32_t type, std::uint32_t flags, const void* data,
+              std::uint32_t size) override;
+    bool backlogged() const override { return out_.size() >= ipc_high_mark; }
+    void wait_for_room(std::weak_ptr<process> writer) override {
+        waiting_.push_back(std::move(writer));
     }
-    template <class OnPacket, class OnBadLength>
-    void take(std::size_t bytes, OnPacket&& on_packet, OnBadLength&& on_bad_length) {
-        in_->add(bytes, std::forward<OnPacket>(on_packet),
-                 std::forward<OnBadLength>(on_bad_length));
+    void count_backlogged_channel(bool backlogged) override {
+        backlogged_channels_ += backlogged ? 1 : -1;
     }
-    // A channel that doesn't read its stdin holds back the pipe that feeds it:
-    // reads pause after each one and go on only while no channel is over its mark.
-    void pause_reads() { read_paused_ = true; }
-    bool resume_reads();
-    void count_backlogged_channel(bool backlogged) { backlogged_channels_ += backlogged ? 1 : -1; }
-
-    // --- out: one gathered write at a time ---
-    // Queues one packet; true when no write is on its way to take it.
-    bool queue_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                      const void* data, std::uint32_t size);
-    // Writes the front of the queue; written() follows a write that went out
-    // (it holds the process alive). A failed or cut write calls nothing.
-    template <class Written> void pump(Written&& written) {
-        writing_ = false;
-        if (out_.empty() || !pipe_.is_open())
-            return;
-        writing_ = true;
-        pipe_.async_write_some(out_.front(),
-                               [this, written = std::forward<Written>(written)](
-                                   const boost::system::error_code& error, std::size_t bytes) {
-                                   if (error)
-                                       return;
-                                   out_.consume(bytes);
-                                   written();
-                               });
-    }
-    bool backlogged() const { return out_.size() >= ipc_high_mark; }
-    // Channels whose output waits for room in the queue; once below the low
-    // mark they are handed back to be resumed.
-    void wait_for_room(std::weak_ptr<process> writer) { waiting_.push_back(std::move(writer)); }
-    std::vector<std::weak_ptr<process>> take_roomed_writers();
-
-    // --- channels: by id while open, and every one not yet ended ---
-    std::map<std::uint32_t, std::weak_ptr<process>> channels;
-    // Every process made as a channel of this one that has not reported its
-    // end: a restarted channel has left `channels` at its predecessor's end,
-    // but is still ours. Each enters in its constructor and leaves in its
-    // report of its end, at the latest in its destructor, so a plain pointer
-    // here is always to a living object.
-    std::unordered_set<process*> own_channels;
+    void resume_reads() override;
+    void join(process* channel) override { own_channels_.insert(channel); }
+    void leave(std::uint32_t id, process* channel) override;
 
   private:
+    // in: a read at a time into the framer (process/ipc_pipe.cpp)
+    void read();
+    void on_read(const boost::system::error_code& error, std::size_t bytes);
+    void on_packet(const packet_header& header, const char* payload);
+    void route_stdin(const packet_header& header, const char* payload);
+    // execute requests (process/execute.cpp)
+    void execute(const packet_header& header, const char* payload);
+    void send_and_forget(std::uint32_t channel, std::uint32_t type, std::uint32_t flags);
+    // out: one gathered write at a time; room wakes the writers that wait
+    void pump();
+    void trace(const packet_header& header, const char* payload, bool sent);
+
+    process& self_;
     platform::stream pipe_;
     std::unique_ptr<framer> in_; // made with the pipe: channels have none
     byte_queue out_;
     bool writing_ = false;
     bool read_paused_ = false;
+    bool attached_ = false;               // made by another program: its close ends us
     std::size_t backlogged_channels_ = 0; // channels whose stdin is over its mark
     std::vector<std::weak_ptr<process>> waiting_;
+    // Channels by id while open; and every process made as a channel of ours
+    // that has not reported its end: a restarted channel has left channels_
+    // at its predecessor's end, but is still ours. Each joins in its
+    // constructor and leaves in its report of its end, at the latest in its
+    // destructor, so a plain pointer here is always to a living object.
+    std::map<std::uint32_t, std::weak_ptr<process>> channels_;
+    std::unordered_set<process*> own_channels_;
 };
 
 } // namespace torvad

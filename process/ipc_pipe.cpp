@@ -1,116 +1,136 @@
-// The traffic of a process's ipc pipe: binding one we were given, reading and
-// framing what comes in, routing it, and pumping what goes out.
-#include "process/process.hpp"
+// The traffic of an ipc pipe: what comes in, read a read at a time, framed
+// and routed to the channels it names; and what goes out, queued, traced and
+// written, with the channels that wait for room woken as it drains.
+#include "process/ipc_link.hpp"
+
+#include <utility>
 
 #include "ipc/trace.hpp"
+#include "process/process.hpp"
 
 namespace torvad {
 
-void process::attach(std::int32_t attach_pid, std::int64_t handle_value) {
-    if (platform::os_error error = link_.attach(handle_value)) {
-        owner.log_error("failed to attach to ipc pipe.");
-        owner.log_verbose("%s", platform::describe(error).c_str());
-        return;
-    }
-    child_.set_pid(static_cast<std::uint32_t>(attach_pid));
-    read_ipc();
-    send_version();
+void ipc_link::start() {
+    read();
+    const run_facts& facts = self_.owner.facts();
+    std::string payload = version_payload(facts.program_name, torvad_version, facts.background);
+    send(0, packet_version, 0, payload.data(), static_cast<std::uint32_t>(payload.size()));
 }
 
-void process::read_ipc() {
-    // The pending read owns the object: see wait_output.
-    link_.read([self = shared_from_this()](const boost::system::error_code& error,
-                                           std::size_t bytes) { self->on_ipc_read(error, bytes); });
+void ipc_link::close_channel_pipes() {
+    for (process* own : own_channels_)
+        own->streams().close();
 }
 
-void process::on_ipc_read(const boost::system::error_code& error, std::size_t bytes) {
-    if (shut_)
+void ipc_link::read() {
+    // The pending read owns the process, as the relayed reads do.
+    pipe_.async_read_some(
+        boost::asio::buffer(in_->free_space(), in_->free_size()),
+        [this, self = self_.shared_from_this()](const boost::system::error_code& error,
+                                                std::size_t bytes) { on_read(error, bytes); });
+}
+
+void ipc_link::on_read(const boost::system::error_code& error, std::size_t bytes) {
+    // Closed by the end or the shutdown of its process: nothing more is routed.
+    if (!pipe_.is_open())
         return;
     if (!error) {
-        link_.take(
+        in_->add(
             bytes,
             [this](const packet_header& header, const char* payload) {
                 on_packet(header, payload);
             },
-            [this] { owner.log_error("bad ipc packet length"); });
-        // A channel that doesn't read its stdin holds back the pipe that feeds it.
-        link_.pause_reads();
-        resume_ipc_read();
+            [this] { self_.owner.log_error("bad ipc packet length"); });
+        // A channel that doesn't read its stdin holds back the pipe that feeds it:
+        // reads pause after each one and go on only while no channel is over its mark.
+        read_paused_ = true;
+        resume_reads();
         return;
     }
-    // An attached pipe has no child whose exit could end the object, so the
+    // An attached pipe has no child whose exit could end the process, so the
     // peer closing its end does: otherwise nothing could ever end the run.
-    if (child_.pid() != 0 && !child_.watched() && link_.open()) {
-        owner.log_info("attached ipc pipe closed.");
-        finish(0, packet_failed);
+    if (attached_) {
+        self_.owner.log_info("attached ipc pipe closed.");
+        self_.on(life_event::pipe_closed);
     }
 }
 
-void process::resume_ipc_read() {
-    if (link_.resume_reads())
-        read_ipc();
+void ipc_link::resume_reads() {
+    if (!read_paused_ || !pipe_.is_open() || backlogged_channels_ != 0)
+        return;
+    read_paused_ = false;
+    read();
 }
 
-void process::on_packet(const packet_header& header, const char* payload) {
-    trace_packet(header, payload, false);
+void ipc_link::on_packet(const packet_header& header, const char* payload) {
+    trace(header, payload, false);
     if (header.type == packet_stdin)
         route_stdin(header, payload);
     else if (header.type == packet_execute)
-        handle_execute(header, payload);
+        execute(header, payload);
     else if (header.type == packet_ready && header.channel == 0)
-        owner.child_ready(*this);
+        self_.owner.child_ready(self_);
 }
 
-void process::route_stdin(const packet_header& header, const char* payload) {
-    auto entry = link_.channels.find(header.channel);
-    if (entry == link_.channels.end()) {
-        owner.log_error("channel 0x%x does not exist", header.channel);
+void ipc_link::route_stdin(const packet_header& header, const char* payload) {
+    auto entry = channels_.find(header.channel);
+    if (entry == channels_.end()) {
+        self_.owner.log_error("channel 0x%x does not exist", header.channel);
         return;
     }
     auto target = entry->second.lock();
-    if (!target || target->stdio_mode_ != stdio_pipes) {
-        owner.log_error("channel 0x%x standard input is not available", header.channel);
+    if (!target || target->what.stdio_mode != stdio_pipes) {
+        self_.owner.log_error("channel 0x%x standard input is not available", header.channel);
         return;
     }
-    target->write_stdin(payload, header.length - packet_header_size,
-                        (header.flags & stdin_close) != 0);
+    target->streams().write_input(payload, header.length - packet_header_size,
+                                  (header.flags & stdin_close) != 0, target);
 }
 
-void process::send_packet(std::uint32_t channel_id, std::uint32_t type, std::uint32_t flags,
-                          const void* data, std::uint32_t size) {
+void ipc_link::send(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
+                    const void* data, std::uint32_t size) {
     // A closed pipe takes nothing more, and its trace would tell of nothing.
-    if (!link_.open())
+    if (!pipe_.is_open())
         return;
-    bool idle = link_.queue_packet(channel_id, type, flags, data, size);
-    if (owner.facts().verbose) {
-        packet_header header{size + packet_header_size, channel_id, type, flags};
-        trace_packet(header, static_cast<const char*>(data), true);
+    out_.push_packet(channel, type, flags, data, size);
+    if (self_.owner.facts().verbose) {
+        packet_header header{size + packet_header_size, channel, type, flags};
+        trace(header, static_cast<const char*>(data), true);
     }
-    if (idle)
-        pump_ipc();
+    // A write in flight takes it with the rest.
+    if (!writing_)
+        pump();
 }
 
-void process::pump_ipc() {
-    link_.pump([self = shared_from_this()] {
-        self->pump_ipc();
-        for (const auto& weak : self->link_.take_roomed_writers())
-            if (auto writer = weak.lock())
-                writer->resume_output();
-    });
-}
-
-void process::send_version() {
-    const run_facts& facts = owner.facts();
-    std::string payload = version_payload(facts.program_name, torvad_version, facts.background);
-    send_packet(0, packet_version, 0, payload.data(), static_cast<std::uint32_t>(payload.size()));
-}
-
-void process::trace_packet(const packet_header& header, const char* payload, bool sent) {
-    // Without -v this is the whole cost of the trace.
-    if (!owner.facts().verbose)
+void ipc_link::pump() {
+    writing_ = false;
+    if (out_.empty() || !pipe_.is_open())
         return;
-    std::string line = trace_line(header, payload, sent, name_, owner.facts().trace_colour);
-    owner.log_verbose("%s", line.c_str());
+    writing_ = true;
+    // A failed or cut write does nothing more; one that went out wakes the
+    // channels that waited for room, once the queue is below its low mark.
+    pipe_.async_write_some(out_.front(),
+                           [this, self = self_.shared_from_this()](
+                               const boost::system::error_code& error, std::size_t bytes) {
+                               if (error)
+                                   return;
+                               out_.consume(bytes);
+                               pump();
+                               if (out_.size() >= ipc_low_mark)
+                                   return;
+                               for (const auto& weak : std::exchange(waiting_, {}))
+                                   if (auto writer = weak.lock())
+                                       writer->streams().resume(writer);
+                           });
+}
+
+void ipc_link::trace(const packet_header& header, const char* payload, bool sent) {
+    // Without -v this is the whole cost of the trace.
+    const run_facts& facts = self_.owner.facts();
+    if (!facts.verbose)
+        return;
+    std::string line = trace_line(header, payload, sent, self_.name, facts.trace_colour);
+    self_.owner.log_verbose("%s", line.c_str());
 }
 
 } // namespace torvad

@@ -29,8 +29,8 @@ platform::os_error launched_child::end_by_force() {
     return error;
 }
 
-bool launched_child::continue_if_stopped() {
-    return watch_.is_open() && platform::continue_if_stopped(watch_);
+void launched_child::continue_if_stopped() {
+    stopped_by_terminal_ = watch_.is_open() && platform::continue_if_stopped(watch_);
 }
 
 void launched_child::close() {

@@ -1,7 +1,8 @@
 // One supervised child: a top-level program, or a channel that another child
 // asked for. It is made of three parts that each hold their own state (the
-// launched program, its relayed streams, its ipc link); the process routes
-// between them, and between itself and its requester and channels.
+// launched program, its relayed streams, its ipc link), which act on their own
+// and report the events of its life to it; its life (process/life.hpp) says
+// what each event does.
 //
 // Who keeps a process alive:
 // - Its owner's set, from create() to owner.remove().
@@ -23,6 +24,7 @@
 #include "ipc/execute.hpp"
 #include "process/ipc_link.hpp"
 #include "process/launched_child.hpp"
+#include "process/life.hpp"
 #include "process/owner.hpp"
 #include "process/relayed_streams.hpp"
 
@@ -47,86 +49,41 @@ class process : public std::enable_shared_from_this<process> {
     // Launches the child; false when it could not be, or was ended at once
     // (the object has then left its owner's set). (process/launch.cpp)
     bool start();
-    // Serves a pipe another program made instead of launching. (process/ipc_pipe.cpp)
+    // Serves a pipe another program made instead of launching. (process/launch.cpp)
     void attach(std::int32_t attach_pid, std::int64_t handle_value);
     // Asks a persistent child to stop with sigterm (continuing it if the
     // terminal had stopped it), ends any other by force.
-    void terminate();
-    void close_pipes();
-    // close_pipes on every channel of this process, a restarted one included.
-    void close_channel_pipes();
+    void terminate() { on(life_event::stop); }
     // Closes every handle it holds, for the owner's shutdown: its pending
     // operations then end without a word.
-    void close_all();
+    void close_all() { on(life_event::shut_down); }
     // "'name' (pid N)", for a log line; the terminal's stop is named too.
     std::string description() const;
-    const std::string& name() const { return name_; }
-    // The request a successor is made from, and its place.
-    execute_request request() const {
-        return {command, user, working_directory, persistent, stdio_mode_};
-    }
-    channel_ref place() const { return {parent, channel}; }
+    // Takes an event of its life through the table (process/life.hpp) and
+    // does what it calls for. The parts report theirs here.
+    void on(life_event event, std::uint32_t value = 0);
+    // What its channels and its requester use of it: the link its channels
+    // send on and wait at; and its streams, which its requester's link
+    // routes stdin to, wakes when there is room, and closes at its end.
+    requester_link& link() { return link_; }
+    relayed_streams& streams() { return streams_; }
 
     process_owner& owner;
-    const std::vector<std::string> command;
-    const std::string user;
-    const std::string working_directory;
-    const std::weak_ptr<process> parent;
-    const std::uint32_t channel;
-    const bool persistent;
+    // The request, as a successor is made from it; and its place.
+    const execute_request what;
+    const channel_ref place;
+    const std::string name; // the program's file name, for log lines and the trace
 
   private:
     process(process_owner& owner, execute_request what, channel_ref ref);
-
-    // launch (process/launch.cpp)
-    bool fail_launch(std::uint32_t status, const platform::os_error& error);
-    bool prepare_stdio(platform::launch_request& request, platform::owned_handle (&theirs)[3]);
-    bool watch_child(platform::launch_result& launched);
-    void wait_for_exit();
-
-    // end (process/end.cpp)
-    void on_exit(const boost::system::error_code& error);
-    void finish_after_output();
+    // The child runs: its exit, output and ipc pipe are waited for.
+    void watch();
+    // Tells the owner (a closed end) and the requester, closes everything and
+    // leaves the owner's set. (process/end.cpp)
     void finish(std::uint32_t status, std::uint32_t end_packet);
-    // Sends the parent end_packet with status and frees the channel id, once.
-    void report_end();
-    void leave_parent();
+    void stop_child();
 
-    // relayed standard streams (process/streams.cpp)
-    void wait_output(int stream);
-    void on_output(int stream, const boost::system::error_code& error);
-    boost::system::error_code forward_output(int stream, process* requester);
-    void relay_output(int stream);
-    bool drain_output();
-    void resume_output();
-    void write_stdin(const char* data, std::uint32_t size, bool close);
-    void pump_stdin();
-    void count_stdin_backlog();
-
-    // the ipc pipe (process/ipc_pipe.cpp)
-    void read_ipc();
-    void on_ipc_read(const boost::system::error_code& error, std::size_t bytes);
-    void on_packet(const packet_header& header, const char* payload);
-    void route_stdin(const packet_header& header, const char* payload);
-    void send_packet(std::uint32_t channel, std::uint32_t type, std::uint32_t flags,
-                     const void* data, std::uint32_t size);
-    void pump_ipc();
-    void resume_ipc_read();
-    void send_version();
-    void trace_packet(const packet_header& header, const char* payload, bool sent);
-
-    // execute requests (process/execute.cpp)
-    void handle_execute(const packet_header& header, const char* payload);
-    void send_and_forget(std::uint32_t channel, std::uint32_t type, std::uint32_t flags);
-
-    std::int32_t stdio_mode_;
-    std::string name_;
-    std::uint32_t end_packet_;
-    std::uint32_t status_ = 0;
-    bool end_reported_ = false;
-    bool stdin_counted_ = false;       // in the requester's count of backlogged channels
-    bool stopped_by_terminal_ = false; // found stopped at the last terminate
-    bool shut_ = false;                // closed by the owner's shutdown: handlers do nothing more
+    child_life life_;
     launched_child child_;
     relayed_streams streams_;
     ipc_link link_;

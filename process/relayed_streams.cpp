@@ -1,5 +1,8 @@
-// Making and closing the relayed pipes, and queueing a channel's stdin.
+// The pipes of a channel's standard streams, one read of output as a packet,
+// and the stdin the child is owed.
 #include "process/relayed_streams.hpp"
+
+#include "process/ipc_link.hpp"
 
 namespace torvad {
 
@@ -19,10 +22,43 @@ void relayed_streams::close() {
     }
 }
 
-bool relayed_streams::queue_input(const char* data, std::uint32_t size, bool close) {
-    stdin_queue_.push(data, size);
-    close_requested_ = close_requested_ || close;
-    return !writing_;
+boost::system::error_code relayed_streams::forward(int stream, requester_link* requester,
+                                                   std::uint32_t channel) {
+    const char* data = nullptr;
+    std::size_t bytes = 0;
+    boost::system::error_code error =
+        platform::take_output(output(stream), buffer(stream), data, bytes);
+    if (error && error != boost::asio::error::would_block) {
+        boost::system::error_code ignored;
+        output(stream).close(ignored);
+    } else if (!error && requester) {
+        requester->send(channel, static_cast<std::uint32_t>(stream), 0, data,
+                        static_cast<std::uint32_t>(bytes));
+    }
+    return error;
+}
+
+void relayed_streams::drop_input(requester_link* requester) {
+    close_requested_ = false;
+    stdin_queue_.clear();
+    count_backlog(requester);
+    // A requester held back by this backlog may read again.
+    if (requester)
+        requester->resume_reads();
+}
+
+void relayed_streams::count_backlog(requester_link* requester) {
+    bool backlogged = stdin_queue_.size() >= stdin_high_mark;
+    if (backlogged == stdin_counted_)
+        return;
+    stdin_counted_ = backlogged;
+    if (requester)
+        requester->count_backlogged_channel(backlogged);
+}
+
+void relayed_streams::close_input() {
+    boost::system::error_code ignored;
+    stdin_.close(ignored);
 }
 
 } // namespace torvad

@@ -1,16 +1,21 @@
-// The relayed standard streams of a channel: our ends of its three pipes, the
-// stdin waiting for the child, and which output stream is held back because
-// the requester's queue is full. A part of its process, which keeps it alive
-// for its reads and writes; the flow between processes is the process's.
+// The relayed standard streams of a channel: our ends of its three pipes, its
+// output relayed to the requester as packets and its stdin queued for the
+// child, each held back when the other side doesn't keep up. A part of its
+// process: its reads and writes hold the process alive, and a read that
+// lands is reported to the process's life, which says whether to relay it.
 #pragma once
 
 #include <cstdint>
+#include <memory>
 
 #include "platform/platform.hpp"
 #include "process/byte_queue.hpp"
 #include "process/flow.hpp"
 
 namespace torvad {
+
+class process;
+class requester_link;
 
 class relayed_streams {
   public:
@@ -21,79 +26,47 @@ class relayed_streams {
     platform::os_error make(platform::owned_handle (&theirs)[3]);
     void close();
 
-    // --- output: streams 1 and 2 ---
-    platform::stream& output(int stream) { return stream == 1 ? stdout_ : stderr_; }
-    platform::output_buffer& buffer(int stream) { return buffers_[stream - 1]; }
-    // One read of stream, handed to send; a stream that ends or fails is
-    // closed, would_block leaves it open.
-    template <class Send> boost::system::error_code forward(int stream, Send&& send) {
-        const char* data = nullptr;
-        std::size_t bytes = 0;
-        boost::system::error_code error =
-            platform::take_output(output(stream), buffer(stream), data, bytes);
-        if (error && error != boost::asio::error::would_block) {
-            boost::system::error_code ignored;
-            output(stream).close(ignored);
-        } else if (!error) {
-            send(data, bytes);
-        }
-        return error;
-    }
-    bool paused(int stream) const { return paused_[stream]; }
-    bool any_paused() const { return paused_[1] || paused_[2]; }
-    void set_paused(int stream, bool paused) { paused_[stream] = paused; }
+    // --- output: streams 1 and 2, to the requester of self ---
+    // Waits until stream has something, then reports it to self's life.
+    void await(int stream, std::shared_ptr<process> self);
+    // Reads what is ready, a few reads per wake so that one busy channel
+    // doesn't starve the others, and waits again; or pauses while the
+    // requester's queue is full, until it has room and resume comes.
+    void relay(int stream, const std::shared_ptr<process>& self);
+    void resume(const std::shared_ptr<process>& self);
+    // The child has ended: takes all its pipes hold. False while a read is
+    // still on its way: it is ended early, and its landing asks again.
+    bool drain(const process& self);
 
-    // --- input: stream 0 ---
-    bool input_open() const { return stdin_.is_open(); }
-    // Queues bytes for the child; true when no write is on its way to take them.
-    bool queue_input(const char* data, std::uint32_t size, bool close);
-    std::size_t queued_input() const { return stdin_queue_.size(); }
-    bool input_backlogged() const { return stdin_queue_.size() >= stdin_high_mark; }
-    // Writes the front of the queue and calls written() once it went out
-    // (written holds the process alive); a requested close follows the last
-    // byte. A write cut short by close() calls nothing.
-    template <class Written> void pump_input(Written&& written) {
-        writing_ = false;
-        if (!stdin_.is_open())
-            return;
-        if (stdin_queue_.empty()) {
-            if (close_requested_)
-                close_input();
-            return;
-        }
-        writing_ = true;
-        stdin_.async_write_some(stdin_queue_.front(),
-                                [this, written = std::forward<Written>(written)](
-                                    const boost::system::error_code& error, std::size_t n) {
-                                    if (error == boost::asio::error::operation_aborted)
-                                        return;
-                                    // Any other failure is the child's end gone: nothing more goes
-                                    // in.
-                                    if (error) {
-                                        close_input();
-                                        stdin_queue_.clear();
-                                    }
-                                    stdin_queue_.consume(n);
-                                    written();
-                                });
-    }
-    // What the child was owed is dropped with the child.
-    void clear_input() {
-        close_requested_ = false;
-        stdin_queue_.clear();
-    }
+    // --- input: stream 0, from the requester of self ---
+    // Queues bytes for the child and writes them; a requested close follows
+    // the last byte. Input behind a close, or for a child that closed its
+    // end, has nowhere to go.
+    void write_input(const char* data, std::uint32_t size, bool close,
+                     const std::shared_ptr<process>& self);
+    // What the child was owed is dropped with the child; the requester's
+    // count and reads go on without it.
+    void drop_input(requester_link* requester);
 
   private:
-    void close_input() {
-        boost::system::error_code ignored;
-        stdin_.close(ignored);
-    }
+    platform::stream& output(int stream) { return stream == 1 ? stdout_ : stderr_; }
+    platform::output_buffer& buffer(int stream) { return buffers_[stream - 1]; }
+    // One read of stream, as one packet on channel (dropped without a
+    // requester); a stream that ends or fails is closed, would_block leaves
+    // it open.
+    boost::system::error_code forward(int stream, requester_link* requester, std::uint32_t channel);
+    void pump_input(std::shared_ptr<process> self);
+    // The requester counts its channels over the mark as their queues cross
+    // it, so that whether it may read costs the same however many it has.
+    void count_backlog(requester_link* requester);
+    void close_input();
 
     platform::stream stdin_, stdout_, stderr_;
     platform::output_buffer buffers_[2]; // stdout's, stderr's
     byte_queue stdin_queue_;
     bool writing_ = false;
     bool close_requested_ = false;
+    bool stdin_counted_ = false;             // in the requester's count of backlogged channels
     bool paused_[3] = {false, false, false}; // by stream number, 1 and 2
 };
 

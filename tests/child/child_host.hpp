@@ -13,9 +13,10 @@ void prepare_streams();
 std::vector<std::string> start_state(int ipc_fd);
 // Leaves count orphans behind that report who adopted them and end when we do.
 bool leave_orphans(int count);
-// Takes first the name of the parent's ipc pipe n, as another program could.
-bool take_pipe_name(int n);
-// Console control event n (1 Ctrl-Break, 2 close) to our parent, as the console sends it.
+// Takes first the parent's pipe names of its random calls "n,n,...", which a
+// bcrypt.dll stand-in makes known; then, with "", whether any was connected.
+bool squat(const std::string& calls);
+// Console event n (1 Ctrl-Break, 2 close, 5 logoff, 6 shutdown) to our parent and to us.
 bool console_event(int n);
 // Makes a pipe and starts torvad with -a on its far end (theirs).
 bool start_attached(const std::string& torvad, int& ours, long& theirs);

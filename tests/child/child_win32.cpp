@@ -2,22 +2,27 @@
 
 #include <tlhelp32.h>
 
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
 #include <io.h>
+#include <sstream>
 
+#include "peer/peer.hpp"
 #include "tests/child/child_host.hpp"
 
 namespace child_host {
 
-// Ctrl-Break at the console reaches every program on it, whatever its group
-// (Ctrl-C is off in the group of its own that torvad gives each child); a
-// peer ends by its sigterm packet, as it does when torvad runs as a service.
+// A console's events reach every program on it, whatever its group (Ctrl-C
+// is off in the group of its own that torvad gives each child); a peer ends
+// by its sigterm packet, as it does when torvad runs as a service.
 void prepare_streams() {
     for (int stream : {0, 1, 2})
         _setmode(stream, _O_BINARY);
-    SetConsoleCtrlHandler([](DWORD event) -> BOOL { return event == CTRL_BREAK_EVENT; }, TRUE);
+    torvad::peer::outlive_console_events();
 }
 
 // A process's handles can't be listed here, and no row asks after the account.
@@ -42,34 +47,47 @@ static DWORD parent_id() {
     return parent;
 }
 
-// Left open until we end, as a squatter would hold it.
 bool notify(const std::string&) {
     return false;
 }
 
-bool take_pipe_name(int n) {
-    std::string name =
-        "\\\\.\\pipe\\torvad_" + std::to_string(parent_id()) + "_" + std::to_string(n);
-    return CreateNamedPipeA(name.c_str(), PIPE_ACCESS_DUPLEX, PIPE_TYPE_BYTE,
-                            PIPE_UNLIMITED_INSTANCES, 4096, 4096, 0,
-                            nullptr) != INVALID_HANDLE_VALUE;
+// Left open until we end, as a squatter would hold them; then whether any
+// was connected (a look at a pipe that nobody opened fails, listening).
+bool squat(const std::string& calls) {
+    static std::vector<HANDLE> taken;
+    std::istringstream list(calls);
+    for (std::string call; std::getline(list, call, ',');) {
+        char name[64] = "\\\\.\\pipe\\torvad_";
+        for (int i = 0; i < 16; ++i)
+            std::snprintf(name + 16 + 2 * i, 3, "%02x", std::atoi(call.c_str()));
+        taken.push_back(CreateNamedPipeA(name, PIPE_ACCESS_DUPLEX, 0, 9, 64, 64, 0, nullptr));
+    }
+    if (!calls.empty())
+        return std::ranges::count(taken, INVALID_HANDLE_VALUE) == 0;
+    for (HANDLE pipe : taken)
+        if (PeekNamedPipe(pipe, nullptr, 0, nullptr, nullptr, nullptr) ||
+            GetLastError() == ERROR_BROKEN_PIPE)
+            return true;
+    return false;
 }
 
-// GenerateConsoleCtrlEvent fails on Wine's terminal console, so the event
-// goes the way the console itself sends it: kernelbase's CtrlRoutine, which
-// lies at the same address in every process, run on a thread in the parent.
+// As the console sends it (Wine's GenerateConsoleCtrlEvent fails): kernelbase's
+// CtrlRoutine, at the same address in every process, on a thread in torvad and
+// in us; waited for where the handlers return (Ctrl-Break, logoff).
 bool console_event(int n) {
     auto routine = reinterpret_cast<LPTHREAD_START_ROUTINE>(
         reinterpret_cast<void*>(GetProcAddress(GetModuleHandleA("kernelbase"), "CtrlRoutine")));
-    HANDLE parent = OpenProcess(PROCESS_ALL_ACCESS, FALSE, parent_id());
-    HANDLE thread =
-        routine == nullptr || parent == nullptr
-            ? nullptr
-            : CreateRemoteThread(parent, nullptr, 0, routine,
-                                 reinterpret_cast<void*>(static_cast<INT_PTR>(n)), 0, nullptr);
-    if (parent != nullptr)
-        CloseHandle(parent);
-    return thread != nullptr && CloseHandle(thread);
+    HANDLE threads[2] = {};
+    for (HANDLE& thread : threads) {
+        HANDLE process = &thread == threads ? OpenProcess(PROCESS_ALL_ACCESS, FALSE, parent_id())
+                                            : GetCurrentProcess();
+        thread = CreateRemoteThread(process, nullptr, 0, routine,
+                                    reinterpret_cast<void*>(static_cast<INT_PTR>(n)), 0, nullptr);
+        if (thread == nullptr)
+            return false;
+    }
+    bool returns = n == CTRL_BREAK_EVENT || n == CTRL_LOGOFF_EVENT;
+    return !returns || WaitForMultipleObjects(2, threads, TRUE, 10000) == WAIT_OBJECT_0;
 }
 
 // A named pipe: torvad reads it overlapped, which an anonymous pipe can't be.

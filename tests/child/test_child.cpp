@@ -110,7 +110,10 @@ int mode_execute(const context& how) {
             std::error_code error;
             say(fs::remove(fs::current_path(), error) ? "rmcwd 0" : "rmcwd -1");
         } else if (end - at > 1) {
-            std::string items = join_strings({how.args.begin() + at + 1, how.args.begin() + end});
+            std::vector<std::string> list(how.args.begin() + at + 1, how.args.begin() + end);
+            if (how.args[at].ends_with('x')) // flags "Nx": the last item is one byte, in hex
+                list.back() = std::string(1, char(std::stoi(list.back(), nullptr, 16)));
+            std::string items = join_strings(list);
             auto block = encode_packet(++channel, packet_execute, std::stoul(how.args[at]),
                                        items.data(), items.size());
             batch.append(block.begin(), block.end());
@@ -209,10 +212,12 @@ int main(int argc, char** argv) {
         return serve(how);
     if (mode == "orphans")
         return child_host::leave_orphans(how.number(0)) ? (say("orphans made"), 3) : 1;
-    // "squat N ...": takes the name of torvad's ipc pipe N, then executes the rest.
-    if (mode == "squat")
-        return say(child_host::take_pipe_name(how.number(0)) ? "squat taken" : "squat failed"),
-               mode_execute({{how.args.begin() + 1, how.args.end()}, how.ipc_fd});
+    // "squat N,N,... ...": takes torvad's pipe names N, executes the rest, tells if heard.
+    if (mode == "squat") {
+        say(child_host::squat(how.args.at(0)) ? "squat taken" : "squat failed");
+        int code = mode_execute({{how.args.begin() + 1, how.args.end()}, how.ipc_fd});
+        return say(child_host::squat("") ? "squat connected" : "squat heard nothing"), code;
+    }
     // "attach TORVAD CHILD": starts TORVAD with -a on a pipe of ours and has it
     // run CHILD forging on that pipe's far end, with pipes, so that handles pass.
     int ours = -1;
@@ -227,8 +232,9 @@ int main(int argc, char** argv) {
             forged = packet.header.channel == 9;
         return say(forged ? "attach forged" : "attach clean"), 0;
     }
-    if (mode == "console-event")
-        return child_host::console_event(how.number(0)) ? serve(how) : 1;
+    // A logoff is no stop: once it has passed, the child ends of its own accord.
+    if (mode == "console-event" && child_host::console_event(how.number(0)))
+        return how.number(0) == 5 ? (say("logoff passed"), 0) : serve(how);
     std::fprintf(stderr, "usage: test_child <mode> [args...] [ipc fd]\n");
     return 64;
 }

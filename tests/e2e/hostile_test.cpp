@@ -55,9 +55,13 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
          {"?exited with 0x3.", "?starting 'test_child' again.", "?child: ready", "z", "!INT",
           "?'test_child' exited with 0x0.", "=0"},
          {.shell = "trap '' CHLD", .where = systems::linux_only}},
-        // Ctrl-Break and the console's close stop the children the same way
+        // Ctrl-Break, close and shutdown at torvad and a peer alike stop in order; logoff not
         {child({"console-event", "1"}), ordered_stop, on_windows},
         {child({"console-event", "2"}), ordered_stop, on_windows},
+        {child({"console-event", "6"}), ordered_stop, on_windows},
+        {child({"console-event", "5"}),
+         {"?child: logoff passed", "?'test_child' exited with 0x0.", "=0", "-stopping torvad"},
+         on_windows},
         // each item reaches the program whole: none of it can become an argument of its own
         {child({"execute", pipes, child_binary, "args", "a\\\" --delete-all", "C:\\dir\\", "x y",
                 "\\\\\"q\\", "", "t\tab", "\"", "\\", "\xc3\xa9\xe2\x82\xac", "end"}),
@@ -66,19 +70,15 @@ TEST(hostile, faults_leave_the_supervisor_serving) {
               utf8 + "][end]\n",
           "!INT", "=0"}},
         // a batch file would have cmd.exe read its arguments: refused, by any spelling
-        {child({"execute", "0", missing + ".bat", "+", "0", missing + ".CmD. "}),
-         {"?refused to run '", "?child: 1 failed 193", "?child: 2 failed 193", "!INT", "=0"},
+        {child({"execute", "0", missing + ".bat", "+", "0", missing + ".CmD. ", "+", "0",
+                missing + ".bat::$DATA"}),
+         {"?refused to run '", "&child: 1 failed 193", "&child: 2 failed 193",
+          "&child: 3 failed 193", "!INT", "=0"},
          on_windows},
         // a program run at an attached peer's request can't write on the peer's pipe
         // and torvad never runs the command behind -a
         {child({"attach", torvad_binary, child_binary}),
          {"?child: attach clean", "?attached ipc pipe closed.", "=0", "-attach forged",
           "-'never_run'"}},
-        // a pipe name taken before torvad makes it fails the launch; nothing reaches the taker
-        {{"-v", "--", child_binary, "squat", "1", "1", child_binary, "peer"},
-         {"?child: squat taken", "?failed to create ipc pipe.", "?failed to create ipc pipe.",
-          "?its name taken by another program", "?child: 1 failed 5", "!INT", "=0",
-          "-child: 1 opened"},
-         on_windows},
     });
 }

@@ -98,3 +98,31 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     EXPECT_TRUE(becomes_true([&] { return !std::filesystem::exists(pid); }));
     run_wine({"sc", "delete", name});
 }
+
+// Items whole on code page 932 (a locale of the test's own), or refused; squatters on
+// each pipe of a launch (torvad's names known through a bcrypt.dll stand-in).
+TEST(windows, items_and_pipes_stay_the_requesters) {
+    if (!under_wine)
+        GTEST_SKIP() << "the Windows build under Wine";
+    scratch_dir ja, known;
+    ASSERT_EQ(std::system(("localedef -i ja_JP -f UTF-8 " + ja.path + "/ja_JP.UTF-8").c_str()), 0);
+    for (const char* file : {"../torvad.exe", "../stand_in/bcrypt.dll"})
+        std::filesystem::copy(std::filesystem::path(child_file).parent_path() / file, known.path);
+    run_rows({
+        // U+2015 and U+8868 end in a backslash's byte there; a lone 0x81 is no text
+        {child({"execute", "2", child_binary, "args", "\u2015\" --delete-all", "C:\\\u8868\\",
+                "next", "+", "2x", child_binary, "args", "81"}),
+         {"&child: 1 stdout child: args [\\x81\\\" --delete-all][C:\\\\x95\\\\][next]\n",
+          "&refused to run '" + child_binary + "': an item is no text of the system's code page.",
+          "&child: 2 failed 1113", "!INT", "=0"},
+         {.env = {"LOCPATH=" + ja.path, "LC_ALL=ja_JP.UTF-8"}}},
+        // the first request's four pipes each find a name taken once, the second's stdin four times
+        {{"-v", "--", child_binary, "squat", "1,3,5,7,9,10,11,12", "3", child_binary, "peer", "+",
+          "3", child_binary, "peer"},
+         {"?child: squat taken", "&child: 1 stdout child: version", "&took 4 pipe names first",
+          "&its name taken by", "&child: 2 failed 5", "!INT", "?child: squat heard nothing", "=0",
+          "-child: 2 opened"},
+         {.env = {"WINEDLLOVERRIDES=mscoree,mshtml=;bcrypt=n"},
+          .program = known.path + "/torvad.exe"}},
+    });
+}

@@ -93,7 +93,10 @@ TEST(patterns, check_names_skipped_lines_and_warns) {
                                 "x{100000}\n"
                                 "x{99999999999999999999}\n"
                                 "/bin/true \n"
-                                "(all) /bin/echo\\0.*\n",
+                                "(all) /bin/echo\\0.*\n"
+                                "C:\\\\Tools\\\\PwSh\\.exe\\0-c\\0.*\n"
+                                "(all) (cmd|x)(\\.exe)?\\0/c\\0dir\n"
+                                "/usr/bin/cmdline\n",
                                 file.skipped);
     patterns_tool::report report = patterns_tool::check("p", file);
     EXPECT_EQ(report.status, 1);
@@ -101,7 +104,8 @@ TEST(patterns, check_names_skipped_lines_and_warns) {
          {"p:3: skipped: ", "\n    ([bad\n", "p:4: skipped: too large to compile",
           "p:5: skipped: a repeat count or back-reference number is too large",
           "p:6: warning: a blank", "p:7: warning: repeats line 2",
-          "p: 2 own-account and 1 any-account patterns, 3 lines skipped, 2 warnings"})
+          "p:8: warning: permits a command interpreter", "p:9: warning: permits a command",
+          "p: 4 own-account and 2 any-account patterns, 3 lines skipped, 4 warnings"})
         EXPECT_NE(report.out.find(expected), std::string::npos) << expected << "\n" << report.out;
     file.skipped.clear();
     EXPECT_EQ(patterns_tool::check("p", file).status, 0);

@@ -69,7 +69,7 @@ struct rig final : process_owner {
     void child_ended(const process& child, std::uint32_t status) override {
         ended.push_back(status);
         if (restart_killed && status > 128)
-            process::create(*this, child.request(), child.place())->start();
+            process::create(*this, child.what, child.place)->start();
     }
     const pattern_lists& patterns() const override { return everything; }
     const run_facts& facts() const override { return run; }
@@ -261,6 +261,47 @@ TEST(process, packets_are_framed_across_reads_and_traced) {
         peer.requester->terminate();
         lines.push_back("-> peer:0 sigterm ");
         EXPECT_EQ(peer.log, lines);
+    }
+}
+
+// A requester's end closes its channels' pipes, as the daemon's order has it:
+// a channel that writes after that dies of the closed pipe.
+TEST(process, a_requester_that_ends_closes_its_channels_pipes) {
+    rig peer;
+    peer.execute(1, execute_stdio_pipes, "sleep 0.3; echo late");
+    ASSERT_TRUE(peer.read_until(1, packet_opened));
+    close(std::exchange(peer.fd, -1));
+    ASSERT_TRUE(peer.read_until([&] { return !peer.ended.empty(); }));
+    EXPECT_EQ(peer.ended, std::vector<std::uint32_t>{platform::signal_status(SIGPIPE)});
+    EXPECT_EQ(peer.log, std::vector<std::string>{"attached ipc pipe closed."});
+}
+
+// The edges of a child's life no end-to-end run reaches on this system: an
+// end or a stop while the output drains, a stop while it launches.
+TEST(process, a_life_moves_by_its_table) {
+    using enum life_event;
+    using step = std::pair<life_event, std::uint32_t>;
+    const std::tuple<std::vector<step>, life_state, life_action, std::uint32_t> rows[] = {
+        {{{launched, 0}, {exited, 5}, {output, 1}, {stop, 0}, {drained, 0}},
+         life_state::ended,
+         life_action::close_end,
+         5},
+        {{{launched, 0}, {exited, 3}, {shut_down, 0}},
+         life_state::shut_down,
+         life_action::close_handles,
+         0},
+        {{{stop, 0}}, life_state::launching, life_action::none, 0},
+        {{{stop, 0}, {launched, 0}}, life_state::running, life_action::watch, 0},
+        {{{attached, 0}, {pipe_closed, 0}, {exited, 4}}, life_state::ended, life_action::none, 4},
+        {{{launch_failed, 2}}, life_state::ended, life_action::fail, 2},
+    };
+    for (const auto& [steps, state, action, value] : rows) {
+        child_life life;
+        child_life::taken last{};
+        for (auto [event, event_value] : steps)
+            last = life.take(event, event_value);
+        EXPECT_EQ(life.state(), state) << steps.size();
+        EXPECT_EQ(std::pair(last.action, last.value), std::pair(action, value)) << steps.size();
     }
 }
 
