@@ -18,7 +18,7 @@ cleanup() {
     { p kube down "$manifest"; p rm -af -t 0; p system reset -f; } >/dev/null 2>&1
     tidy_cgroups; rm -rf "$store"
 }
-tidy_cgroups() { # podman 5 leaves even removed pods' cgroups: those made since the start go
+tidy_cgroups() { # podman leaves even removed pods' cgroups: those made since the start go
     find $parents -mindepth 1 -depth -type d -newer "$store/started" -exec rmdir {} \; 2>/dev/null
     [ -z "$cgroups" ] || rmdir $parents 2>/dev/null; }
 trap cleanup EXIT
