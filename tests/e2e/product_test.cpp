@@ -101,6 +101,7 @@ TEST(product, the_program_here_starts_with_its_account) {
     struct row {
         const char* script; // the stub powershell's body; none when null
         std::vector<std::string> steps, programs = {"core"};
+        bool beside = false; // a copy of torvad in the product, run without -d
     };
     const row rows[] = {
         {"printf 'no_such\\ruser\\r\\nnobody\\n'",
@@ -117,7 +118,8 @@ TEST(product, the_program_here_starts_with_its_account) {
         // a megabyte on one line, then more: cut, never blocking
         {"head -c 1048576 /dev/zero | tr '\\0' x; echo; seq 100000",
          {"?Failed to logon as user 'xxxxxxxx", "=0"}},
-        {"", {core_ran, "=0", "-wfe runs"}, {"core", "wfe"}},
+        // core wins over wfe; without -d the product is the one beside torvad's own file
+        {"", {core_ran, "=0", "-wfe runs"}, {"core", "wfe"}, true},
         {"",
          geteuid() == 0
              ? std::vector<std::string>{"?wfe runs as nobody", "?'wfe' exited with 0x0.", "=0"}
@@ -125,7 +127,7 @@ TEST(product, the_program_here_starts_with_its_account) {
                                         "=0"},
          {"wfe"}},
     };
-    for (const auto& [script, steps, programs] : rows) {
+    for (const auto& [script, steps, programs, beside] : rows) {
         SCOPED_TRACE(script ? script : "no powershell");
         installation site;
         for (const auto& program : programs)
@@ -136,7 +138,12 @@ TEST(product, the_program_here_starts_with_its_account) {
         if (steps.back().starts_with("&failed to open patterns"))
             close(bound_datagram_socket(site.product + "/exec.patterns"));
         site.env.push_back("NOTIFY_SOCKET=/run/x");
-        run_scenario({"-d", site.product}, steps, {.env = site.env});
+        options how{.env = site.env};
+        if (beside)
+            std::filesystem::copy(torvad_binary, how.program = site.product + "/torvad");
+        run_scenario(beside ? std::vector<std::string>{}
+                            : std::vector<std::string>{"-d", site.product},
+                     steps, how);
         EXPECT_EQ(site.log("powershell"),
                   script && programs[0] == "core"
                       ? "-noprofile\n-noninteractive\n-executionpolicy\nbypass\n-file\n" +
