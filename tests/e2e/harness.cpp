@@ -227,6 +227,8 @@ int daemon_run::wait_exit() {
 // Wine has forked for a launch and not yet started: its handler deadlocks on
 // the allocator's lock, copied held, and torvad waits for the fork forever.
 // So only !GROUP types it; the others send torvad alone the same signal.
+// torvad itself can still take it inside such a fork and deadlock alike:
+// that is Wine's handler, which no Windows program can mask.
 void daemon_run::signal(int signal_number, bool group) {
     if (under_wine && group)
         (void)!write(out_fd_, "\x03", 1);
