@@ -223,11 +223,17 @@ int daemon_run::wait_exit() {
 }
 
 // A console under Wine has one stop request, Ctrl-C, whatever was asked for.
+// Typed, it is a SIGINT to the terminal's whole group, which holds any process
+// Wine has forked for a launch and not yet started: its handler deadlocks on
+// the allocator's lock, copied held, and torvad waits for the fork forever.
+// So only !GROUP types it; the others send torvad alone the same signal.
+// torvad itself can still take it inside such a fork and deadlock alike:
+// that is Wine's handler, which no Windows program can mask.
 void daemon_run::signal(int signal_number, bool group) {
-    if (under_wine)
+    if (under_wine && group)
         (void)!write(out_fd_, "\x03", 1);
     else
-        kill(group ? -pid_ : pid_, signal_number);
+        kill(group ? -pid_ : pid_, under_wine ? SIGINT : signal_number);
 }
 
 // Windows programs see the Linux root as drive Z:.

@@ -42,7 +42,7 @@ inline const options on_linux{.where = systems::linux_only},
 //   "$command" a shell command of the test's own, which must succeed
 // With a manager: "@message" expects its next report (a regex), "@*" drops those still
 // unread, "@" expects none, "!USR2" sends torvad a SIGUSR2.
-// Under Wine every stop request is Ctrl-C typed at the console.
+// Under Wine every stop request is Ctrl-C, typed at the console only for !GROUP.
 void run_scenario(const std::vector<std::string>& args, const std::vector<std::string>& steps,
                   const options& how = {});
 
