@@ -13,6 +13,7 @@ namespace torvad::wrap {
 struct running_program {
     long pid = 0;
     std::intptr_t handle = 0; // Windows: the process handle
+    int stop_signal = 0;      // the stop it was started for
 };
 
 // The stop signal an option names ("TERM", "SIGHUP", "2"); -1 for none the
@@ -24,13 +25,19 @@ int default_stop_signal();
 void keep_link_from_program(long link);
 
 // Starts command with our own standard streams, in a process group of its
-// own, with NOTIFY_SOCKET set to notify_address when that isn't empty.
+// own, with NOTIFY_SOCKET set to notify_address when that isn't empty, to be
+// stopped by stop_signal.
 // Returns 0, or the error number of the failed start.
 int start_program(const std::vector<std::string>& command, const std::string& notify_address,
-                  running_program& out);
-// Asks the program to stop its own way: the signal to its process group on
-// Linux, Ctrl-Break to its process group on Windows.
-bool stop_program(const running_program& program, int stop_signal);
+                  int stop_signal, running_program& out);
+// Asks the program to stop its own way: its stop signal to its process group
+// on Linux, Ctrl-Break to its process group on Windows. A failure names the
+// call and its error number.
+struct stop_failure {
+    int error = 0;
+    const char* call = "";
+};
+stop_failure stop_program(const running_program& program);
 // Waits for the program's end: its status is its exit code, or 128 + the
 // signal that ended it, also named.
 struct program_end {

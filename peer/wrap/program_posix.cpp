@@ -44,7 +44,8 @@ void keep_link_from_program(long link) {
 // The program starts as a program started by a shell would: default signal
 // actions, nothing blocked, though we ignore Ctrl-C and hold our stop signals.
 int start_program(const std::vector<std::string>& command, const std::string& notify_address,
-                  running_program& out) {
+                  int stop_signal, running_program& out) {
+    out.stop_signal = stop_signal;
     if (notify_address.empty() ? unsetenv("NOTIFY_SOCKET") == -1
                                : setenv("NOTIFY_SOCKET", notify_address.c_str(), 1) == -1)
         return errno;
@@ -70,8 +71,11 @@ int start_program(const std::vector<std::string>& command, const std::string& no
     return error;
 }
 
-bool stop_program(const running_program& program, int stop_signal) {
-    return kill(-static_cast<pid_t>(program.pid), stop_signal) == 0;
+// A group already gone has nothing left to stop: its end is on its way.
+stop_failure stop_program(const running_program& program) {
+    if (kill(-static_cast<pid_t>(program.pid), program.stop_signal) == -1 && errno != ESRCH)
+        return {errno, "kill"};
+    return {};
 }
 
 program_end wait_for_program(const running_program& program) {

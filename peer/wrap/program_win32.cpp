@@ -73,7 +73,7 @@ void keep_link_from_program(long link) {
 }
 
 int start_program(const std::vector<std::string>& command, const std::string& /*notify_address*/,
-                  running_program& out) {
+                  int stop_signal, running_program& out) {
     // No notify socket here: a program that has one from further up must not
     // report to a manager that isn't ours.
     SetEnvironmentVariableA("NOTIFY_SOCKET", nullptr);
@@ -98,12 +98,15 @@ int start_program(const std::vector<std::string>& command, const std::string& /*
     CloseHandle(started.hThread);
     out.pid = static_cast<long>(started.dwProcessId);
     out.handle = reinterpret_cast<std::intptr_t>(started.hProcess);
+    out.stop_signal = stop_signal;
     return 0;
 }
 
 // A new process group's id is its first process's.
-bool stop_program(const running_program& program, int /*stop_signal*/) {
-    return GenerateConsoleCtrlEvent(CTRL_BREAK_EVENT, static_cast<DWORD>(program.pid)) != 0;
+stop_failure stop_program(const running_program& program) {
+    if (!GenerateConsoleCtrlEvent(CTRL_BREAK_EVENT, static_cast<DWORD>(program.pid)))
+        return {static_cast<int>(GetLastError()), "GenerateConsoleCtrlEvent"};
+    return {};
 }
 
 program_end wait_for_program(const running_program& program) {
@@ -112,7 +115,7 @@ program_end wait_for_program(const running_program& program) {
         !GetExitCodeProcess(handle_of(program.handle), &code))
         return {128, 0};
     int status = static_cast<int>(code);
-    return {status, code == STATUS_CONTROL_C_EXIT ? break_signal : 0};
+    return {status, code == STATUS_CONTROL_C_EXIT ? program.stop_signal : 0};
 }
 
 std::string error_text(int error) {

@@ -55,13 +55,16 @@ bool scan(int argc, char** argv, wrap_options& out) {
 wrap::running_program program;
 std::atomic<bool> started = false;
 std::atomic<int> stop_sent = 0;
-int stop_signal = 0;
 
+// A stop that can't be sent leaves the program running and torvad waiting:
+// the line says why.
 void stop() {
     if (!started)
         return;
-    stop_sent = stop_signal;
-    wrap::stop_program(program, stop_signal);
+    stop_sent = program.stop_signal;
+    if (wrap::stop_failure failed = wrap::stop_program(program); failed.error != 0)
+        std::fprintf(stderr, "torvad-wrap: can't stop the program: %s: %s\n", failed.call,
+                     wrap::error_text(failed.error).c_str());
 }
 
 // The version, first, is passed over like any packet but sigterm: the
@@ -108,7 +111,6 @@ int run(int argc, char** argv) {
     int fd = peer::ipc_fd_from_arguments(argc, argv);
     if (fd < 0 || !scan(argc, argv, options))
         return std::fputs(usage, stderr), 2;
-    stop_signal = options.stop_signal;
     wrap::watch_own_stop_requests(stop);
     wrap::keep_link_from_program(fd);
     peer::connection link(fd);
@@ -120,7 +122,8 @@ int run(int argc, char** argv) {
                      "torvad-wrap: no NOTIFY_SOCKET for the program (%s); -i makes it "
                      "ready at once.\n",
                      wrap::error_text(socket.error).c_str());
-    if (int error = wrap::start_program(options.command, socket.address, program)) {
+    if (int error =
+            wrap::start_program(options.command, socket.address, options.stop_signal, program)) {
         std::fprintf(stderr, "torvad-wrap: cannot run '%s': %s\n", options.command[0].c_str(),
                      wrap::error_text(error).c_str());
         return error;
