@@ -42,6 +42,7 @@ void say(std::string line) {
 struct context {
     std::vector<std::string> args; // behind the mode, without the ipc fd
     int ipc_fd = -1;
+    bool says_ready = false; // sends ready once it has the version
     int number(std::size_t i) const { return i < args.size() ? std::atoi(args[i].c_str()) : 0; }
 };
 
@@ -77,7 +78,11 @@ int serve(const context& how, bool deaf = false) {
     if (how.ipc_fd < 0)
         return 0;
     connection link(how.ipc_fd);
-    return greet(link) ? await_sigterm(link, deaf) : 5;
+    if (!greet(link))
+        return 5;
+    if (how.says_ready)
+        link.send_ready();
+    return await_sigterm(link, deaf);
 }
 
 // What the child was started with.
@@ -147,13 +152,15 @@ int main(int argc, char** argv) {
     context how{{}, peer::ipc_fd_from_arguments(argc, argv)};
     // Named core, it is the product's server program: -h gives its version on
     // stderr (unless a file "silent" is there); else it reports as the fds mode
-    // does, to "core.log" when that is there.
+    // does, to "core.log" when that is there, and says it is ready when a file
+    // "ready" is there.
     bool core = fs::path(argv[0]).stem() == "core";
     if (core && argc > 1 && std::string_view(argv[1]) == "-h")
         return std::fputs(fs::exists("silent") ? "usage: core\n" : "test_child version 1\n",
                           stderr) < 0;
     if (core && fs::exists("core.log"))
         out_fd = open("core.log", O_WRONLY | O_APPEND);
+    how.says_ready = core && fs::exists("ready");
     if (core)
         return mode_fds(how);
     if (argc > 1)

@@ -67,6 +67,8 @@ TEST(windows, silent_core_hands_the_service_over_and_ends_with_1) {
 // Created, started, queried and stopped with sc.exe, as an installation runs
 // torvad on the product in its working directory: core.exe reports to
 // core.log, with no console to write to, its version first and its sigterm last.
+// With -r the start stays pending, its checkpoint growing, until core says it
+// is ready (when a file "ready" is there).
 TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     if (!under_wine)
         GTEST_SKIP() << "the Windows build under Wine";
@@ -82,8 +84,12 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     int created = 1;
     std::string said = run_wine({"sc", "create", name, "binpath=", command}, &created);
     ASSERT_EQ(created, 0) << said;
-    auto in_state = [&name](const char* state) {
-        return run_wine({"sc", "query", name}).find(state) != std::string::npos;
+    auto in_state = [&name](const char* state, unsigned checkpoint = 0) {
+        std::string query = run_wine({"sc", "query", name});
+        std::size_t at = query.find("CHECKPOINT");
+        return query.find(state) != std::string::npos &&
+               (at == std::string::npos ||
+                std::stoul(query.substr(query.find("0x", at)), nullptr, 16) >= checkpoint);
     };
     run_wine({"sc", "start", name});
     EXPECT_TRUE(becomes_true([&] { return in_state("RUNNING"); }));
@@ -96,6 +102,19 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     EXPECT_TRUE(becomes_true([&] { return read_file(record).ends_with("child: sigterm\r\n"); }))
         << read_file(record);
     EXPECT_TRUE(becomes_true([&] { return !std::filesystem::exists(pid); }));
+    run_wine({"sc", "delete", name});
+    name += "_r";
+    command.insert(command.find(" -p"), " -r");
+    ASSERT_EQ((run_wine({"sc", "create", name, "binpath=", command}, &created), created), 0);
+    for (bool ready : {false, true}) {
+        run_wine({"sc", "start", name});
+        EXPECT_TRUE(becomes_true([&] {
+            return ready ? in_state("RUNNING") : in_state("START_PENDING", 3);
+        })) << ready;
+        run_wine({"sc", "stop", name});
+        EXPECT_TRUE(becomes_true([&] { return in_state("STOPPED"); }));
+        std::ofstream(dir.path + "/ready");
+    }
     run_wine({"sc", "delete", name});
 }
 
