@@ -102,16 +102,15 @@ void write_event_record(event_type type, const char* text);
 // Which half of the ipc pipe could not be had: ours, made first, or the
 // child's end, opened on it.
 enum class pipe_step { none, create, open };
+// Each pipe adds to taken_names the names another program had taken first;
+// each was tried again under a fresh name (on Windows; a pair has no name).
 // The duplex pipe of a persistent child: ours bound to the loop, theirs to be
 // inherited by the child, whose last argument names it. On failure failed
 // says which half it was.
-os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed);
+os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed, int& taken_names);
 // A relayed standard stream: for stdin (stream 0) the child reads theirs and
 // we write ours; for stdout and stderr (1, 2) the other way round.
-os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs);
-// How many pipe names another program had taken first since the last call;
-// each was tried again under a fresh name (on Windows; a pair has no name).
-int taken_pipe_names();
+os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs, int& taken_names);
 // Binds a pipe that another program made and gave us by its handle value.
 os_error attach_pipe(stream& ours, std::int64_t value);
 

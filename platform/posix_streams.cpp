@@ -31,7 +31,7 @@ os_error bind(stream& ours, owned_handle& handle) {
 } // namespace
 
 // Both ends come from one call, so only their making can fail.
-os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed) {
+os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed, int&) {
     failed = pipe_step::create;
     int ends[2];
     if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) == -1)
@@ -46,11 +46,7 @@ os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed) {
     return {};
 }
 
-int taken_pipe_names() {
-    return 0;
-}
-
-os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) {
+os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs, int&) {
     int ends[2];
     if (pipe2(ends, O_CLOEXEC) == -1)
         return {errno, "pipe2"};

@@ -73,7 +73,6 @@ os_error bind(stream& ours, owned_handle& handle) {
 
 const char* const name_taken = "CreateNamedPipeA, its name taken by another program";
 const char* const connected_elsewhere = "CreateFileA, connected to another program's pipe";
-int taken_names = 0; // since taken_pipe_names last told them
 
 // One instance of the pipe name, ours bound to the loop, theirs opened on it,
 // which connects the pipe. Each pipe is made ours alone rather than left open
@@ -132,7 +131,8 @@ os_error make_pipe_named(const std::string& name, DWORD open_mode, DWORD pipe_mo
 constexpr int name_tries = 4;
 
 os_error make_pipe(DWORD open_mode, DWORD pipe_mode, DWORD buffer_size, stream& ours,
-                   DWORD their_access, DWORD their_flags, owned_handle& theirs, pipe_step& failed) {
+                   DWORD their_access, DWORD their_flags, owned_handle& theirs, pipe_step& failed,
+                   int& taken_names) {
     os_error error;
     for (int attempt = 0; attempt < name_tries; ++attempt) {
         std::string name;
@@ -153,26 +153,23 @@ os_error make_pipe(DWORD open_mode, DWORD pipe_mode, DWORD buffer_size, stream& 
 
 } // namespace
 
-os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed) {
+os_error make_ipc_pipe(stream& ours, owned_handle& theirs, pipe_step& failed, int& taken_names) {
     return make_pipe(FILE_FLAG_OVERLAPPED, PIPE_TYPE_MESSAGE | PIPE_READMODE_MESSAGE, 8192, ours,
-                     GENERIC_READ | GENERIC_WRITE, FILE_FLAG_OVERLAPPED, theirs, failed);
+                     GENERIC_READ | GENERIC_WRITE, FILE_FLAG_OVERLAPPED, theirs, failed,
+                     taken_names);
 }
 
 // Our end overlapped for the loop; the child's end plain, as a program's
 // standard handles are, and one way only.
-os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs) {
+os_error make_relay_pipe(int stream_number, stream& ours, owned_handle& theirs, int& taken_names) {
     pipe_step failed = pipe_step::none;
-    os_error error =
-        make_pipe(FILE_FLAG_OVERLAPPED, PIPE_TYPE_BYTE | PIPE_READMODE_BYTE, 65536, ours,
-                  stream_number == 0 ? GENERIC_READ : GENERIC_WRITE, 0, theirs, failed);
+    os_error error = make_pipe(FILE_FLAG_OVERLAPPED, PIPE_TYPE_BYTE | PIPE_READMODE_BYTE, 65536,
+                               ours, stream_number == 0 ? GENERIC_READ : GENERIC_WRITE, 0, theirs,
+                               failed, taken_names);
     boost::system::error_code ignored;
     if (failed == pipe_step::open)
         ours.close(ignored);
     return error;
-}
-
-int taken_pipe_names() {
-    return std::exchange(taken_names, 0);
 }
 
 os_error attach_pipe(stream& ours, std::int64_t value) {

@@ -3,8 +3,9 @@
 
 namespace torvad {
 
-platform::os_error ipc_link::make(platform::owned_handle& theirs, platform::pipe_step& failed) {
-    platform::os_error error = platform::make_ipc_pipe(pipe_, theirs, failed);
+platform::os_error ipc_link::make(platform::owned_handle& theirs, platform::pipe_step& failed,
+                                  int& taken_names) {
+    platform::os_error error = platform::make_ipc_pipe(pipe_, theirs, failed, taken_names);
     if (!error)
         in_ = std::make_unique<framer>();
     return error;

@@ -49,8 +49,10 @@ class ipc_link final : public requester_link {
   public:
     ipc_link(process& self, boost::asio::io_context& loop) : self_(self), pipe_(loop) {}
 
-    // A new pipe, theirs for the child; or one another program made.
-    platform::os_error make(platform::owned_handle& theirs, platform::pipe_step& failed);
+    // A new pipe, theirs for the child (taken_names grows by the names another
+    // program had taken first); or one another program made.
+    platform::os_error make(platform::owned_handle& theirs, platform::pipe_step& failed,
+                            int& taken_names);
     platform::os_error attach(std::int64_t handle_value);
     bool open() const { return pipe_.is_open(); }
     // Reads the pipe from now on, and sends the version packet.

@@ -6,11 +6,11 @@
 
 namespace torvad {
 
-platform::os_error relayed_streams::make(platform::owned_handle (&theirs)[3]) {
+platform::os_error relayed_streams::make(platform::owned_handle (&theirs)[3], int& taken_names) {
     platform::stream* ours[3] = {&stdin_, &stdout_, &stderr_};
     for (int stream = 0; stream < 3; ++stream)
         if (platform::os_error error =
-                platform::make_relay_pipe(stream, *ours[stream], theirs[stream]))
+                platform::make_relay_pipe(stream, *ours[stream], theirs[stream], taken_names))
             return error;
     return {};
 }

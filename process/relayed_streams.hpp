@@ -22,8 +22,9 @@ class relayed_streams {
     explicit relayed_streams(boost::asio::io_context& loop)
         : stdin_(loop), stdout_(loop), stderr_(loop) {}
 
-    // Makes the three pipes; theirs are the child's ends, in stream order.
-    platform::os_error make(platform::owned_handle (&theirs)[3]);
+    // Makes the three pipes; theirs are the child's ends, in stream order,
+    // and taken_names grows by the names another program had taken first.
+    platform::os_error make(platform::owned_handle (&theirs)[3], int& taken_names);
     void close();
 
     // --- output: streams 1 and 2, to the requester of self ---
