@@ -1,8 +1,9 @@
 // Restart latency: from a failing child's exit to its successor's start,
 // median over 1000 restarts under torvad, under torvad through torvad-wrap,
-// and in a bare loop that waits on a pidfd and spawns the same child at once.
-// The three take turns, one restart each, so that all see the same load: each
-// child records its start, says it is ready and waits until the bench lets it
+// under torvad through the least program in front (bench_restart_front: it
+// starts the child and waits, nothing more), and in a bare loop that waits on
+// a pidfd and spawns the same child at once. The four take turns, one restart each, so that all see
+// the same load: each child records its start, says it is ready and waits until the bench lets it
 // exit (two FIFOs, the gate), and the bench lets the next one go only once
 // the last one's successor has said it is ready. Before the end it reads what
 // the wrapper holds in memory, against torvad's own.
@@ -160,8 +161,9 @@ struct scratch {
     }
     ~scratch() {
         for (const char* name :
-             {"torvad.log", "wrap.log", "bare.log", "torvad.gate.ready", "torvad.gate.go",
-              "wrap.gate.ready", "wrap.gate.go", "bare.gate.ready", "bare.gate.go"})
+             {"torvad.log", "wrap.log", "front.log", "bare.log", "torvad.gate.ready",
+              "torvad.gate.go", "wrap.gate.ready", "wrap.gate.go", "front.gate.ready",
+              "front.gate.go", "bare.gate.ready", "bare.gate.go"})
             unlink(file(name).c_str());
         if (!dir.empty())
             rmdir(dir.c_str());
@@ -173,7 +175,7 @@ struct scratch {
 // Takes the turns; false when a child or torvad failed on the way. Before
 // the children are let go, measure looks at them once more.
 template <class Measure>
-bool take_turns(gate (&supervised)[2], gate& bare_gate, bare_loop& bare, Measure measure) {
+bool take_turns(gate (&supervised)[3], gate& bare_gate, bare_loop& bare, Measure measure) {
     for (gate& side : supervised)
         if (!side.wait_for_child())
             return false;
@@ -189,8 +191,10 @@ bool take_turns(gate (&supervised)[2], gate& bare_gate, bare_loop& bare, Measure
             return false;
     }
     measure();
-    bool ended = supervised[0].release(end_clean) && supervised[1].release(end_clean) &&
-                 bare_gate.release(end_clean);
+    bool ended = true;
+    for (gate& side : supervised)
+        ended = side.release(end_clean) && ended;
+    ended = bare_gate.release(end_clean) && ended;
     return bare.reap() == 0 && ended;
 }
 
@@ -269,47 +273,64 @@ int main(int argc, char** argv) {
         return 1;
     }
     self[length] = '\0';
-    std::string logs[] = {files.file("torvad.log"), files.file("wrap.log"), files.file("bare.log")};
-    gate supervised[] = {{files.file("torvad.gate")}, {files.file("wrap.gate")}};
-    gate bare_gate{files.file("bare.gate")};
-    if (!supervised[0].open_fifos() || !supervised[1].open_fifos() || !bare_gate.open_fifos())
-        return 1;
+    std::string front = std::string(self, std::strrchr(self, '/')) + "/bench_restart_front";
     char wrap_path[4096];
-    if (realpath(wrap, wrap_path) == nullptr)
+    if (realpath(wrap, wrap_path) == nullptr || access(front.c_str(), X_OK) != 0)
         return 1;
-    console_run plain, wrapped;
-    if (!plain.start({torvad, "--", self, "child", logs[0].c_str(), supervised[0].path.c_str()}) ||
-        !wrapped.start(
-            {torvad, "--", wrap_path, self, "child", logs[1].c_str(), supervised[1].path.c_str()}))
+    // The supervised sides: the child alone, through torvad-wrap, through the least front.
+    const char* const names[] = {"torvad", "wrap", "front"};
+    std::vector<const char*> fronts[] = {{}, {wrap_path}, {front.c_str()}};
+    std::string logs[4];
+    gate supervised[3];
+    console_run runs[3];
+    for (int side = 0; side < 3; ++side) {
+        logs[side] = files.file((names[side] + std::string(".log")).c_str());
+        supervised[side].path = files.file((names[side] + std::string(".gate")).c_str());
+        std::vector<const char*> argv{torvad, "--"};
+        argv.insert(argv.end(), fronts[side].begin(), fronts[side].end());
+        argv.insert(argv.end(), {self, "child", logs[side].c_str(), supervised[side].path.c_str()});
+        if (!supervised[side].open_fifos() || !runs[side].start(argv))
+            return 1;
+    }
+    logs[3] = files.file("bare.log");
+    gate bare_gate{files.file("bare.gate")};
+    if (!bare_gate.open_fifos())
         return 1;
     bare_loop bare{
-        {self, const_cast<char*>("child"), logs[2].data(), bare_gate.path.data(), nullptr}};
+        {self, const_cast<char*>("child"), logs[3].data(), bare_gate.path.data(), nullptr}};
     std::pair<long, long> wrapper_kb, torvad_kb;
     bool turns_ok = take_turns(supervised, bare_gate, bare, [&] {
-        wrapper_kb = own_memory_kb(first_child(wrapped.pid));
-        torvad_kb = own_memory_kb(wrapped.pid);
+        wrapper_kb = own_memory_kb(first_child(runs[1].pid));
+        torvad_kb = own_memory_kb(runs[1].pid);
     });
     // A child that failed on the way leaves torvad waiting for nothing.
-    if (!turns_ok)
-        kill(-plain.pid, SIGKILL), kill(-wrapped.pid, SIGKILL);
-    bool torvads_ok = plain.finish() && wrapped.finish();
-    std::vector<double> gaps[3];
-    for (int side = 0; side < 3; ++side)
-        gaps[side] = restart_gaps_us(logs[side]);
-    if (!turns_ok || !torvads_ok || gaps[0].size() != restarts || gaps[1].size() != restarts ||
-        gaps[2].size() != restarts) {
-        std::fprintf(stderr,
-                     "incomplete run: %zu restarts under torvad, %zu through torvad-wrap, %zu in "
-                     "the bare loop\n",
-                     gaps[0].size(), gaps[1].size(), gaps[2].size());
-        return 1;
+    for (console_run& run : runs)
+        if (!turns_ok)
+            kill(-run.pid, SIGKILL);
+    bool torvads_ok = true;
+    for (console_run& run : runs)
+        torvads_ok = run.finish() && torvads_ok;
+    double medians[4];
+    for (int side = 0; side < 4; ++side) {
+        std::vector<double> gaps = restart_gaps_us(logs[side]);
+        if (!turns_ok || !torvads_ok || gaps.size() != restarts) {
+            std::fprintf(stderr, "incomplete run: %zu restarts in %s\n", gaps.size(),
+                         logs[side].c_str());
+            return 1;
+        }
+        medians[side] = median(gaps);
     }
-    double ours = median(gaps[0]), through_wrap = median(gaps[1]), baseline = median(gaps[2]);
+    double ours = medians[0], through_wrap = medians[1], through_front = medians[2];
     std::printf("restart latency median over %d, taking turns: torvad %.0f us, bare loop %.0f us, "
                 "ratio %.2f\n",
-                restarts, ours, baseline, ours / baseline);
+                restarts, ours, medians[3], ours / medians[3]);
     std::printf("through torvad-wrap: %.0f us, ratio %.2f to the bare restart under torvad\n",
                 through_wrap, through_wrap / ours);
+    // Any program in front that ends with its child adds one process's start
+    // and end to each restart: what is left beyond that is the wrapper's own.
+    std::printf("through the least front (start, wait, end): %.0f us, ratio %.2f; torvad-wrap "
+                "over it: ratio %.2f\n",
+                through_front, through_front / ours, through_wrap / through_front);
     std::printf("torvad-wrap's own memory: %ld kB private, %ld kB proportional (Pss); torvad's: "
                 "%ld kB, %ld kB; ratio %.2f\n",
                 wrapper_kb.first, wrapper_kb.second, torvad_kb.first, torvad_kb.second,

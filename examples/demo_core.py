@@ -56,6 +56,9 @@ def account():
 
 
 def main():
+    # A console's Ctrl-Break or close reaches us as it reaches torvad, whose
+    # sigterm is then our orderly end.
+    tp.outlive_console_events()
     # torvad asks this before every start; without "version" on the first
     # line of stderr it would hand the service over to us.
     if sys.argv[1:2] == ["-h"]:

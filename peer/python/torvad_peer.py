@@ -180,6 +180,32 @@ if sys.platform == "win32":
     import _winapi
 
     _ERROR_MORE_DATA = 234
+    _CTRL_C, _CTRL_CLOSE, _CTRL_SHUTDOWN = 0, 2, 6
+    _console_handler = None  # kept alive for as long as the system may call it
+
+    def outlive_console_events():
+        """Keeps the program running through the events a Windows console
+        sends to every program on it (Ctrl-Break, its close, the system's
+        shutdown, a logoff): torvad hears them too and stops its children in
+        order, so the program ends at its sigterm, not before. Call it first
+        thing; nothing to do on Linux, where torvad keeps the terminal's
+        signals from its children. False when the handler can't be set."""
+        global _console_handler
+        import ctypes
+        from ctypes import wintypes
+
+        # The close and the shutdown end the program once a handler returns,
+        # so the handler holds its thread until the program has ended on its
+        # own; Ctrl-C goes on to Python's own handler.
+        def hold(event):
+            while event in (_CTRL_CLOSE, _CTRL_SHUTDOWN):
+                time.sleep(3600)
+            return event != _CTRL_C
+
+        handler_type = ctypes.WINFUNCTYPE(wintypes.BOOL, wintypes.DWORD)
+        _console_handler = handler_type(hold)
+        kernel32 = ctypes.WinDLL("kernel32", use_last_error=True)
+        return bool(kernel32.SetConsoleCtrlHandler(_console_handler, True))
 
     def _link_is_open(value):
         try:
@@ -225,6 +251,9 @@ else:
     import fcntl
     import select
     import socket
+
+    def outlive_console_events():
+        return True
 
     def _link_is_open(value):
         try:
