@@ -78,10 +78,8 @@ int serve(const context& how, bool deaf = false) {
     if (how.ipc_fd < 0)
         return 0;
     connection link(how.ipc_fd);
-    if (!greet(link))
+    if (!greet(link) || (how.says_ready && !link.send_ready()))
         return 5;
-    if (how.says_ready)
-        link.send_ready();
     return await_sigterm(link, deaf);
 }
 

@@ -86,10 +86,10 @@ TEST(service, the_manager_starts_queries_and_stops_it_in_order) {
     ASSERT_EQ(created, 0) << said;
     auto in_state = [&name](const char* state, unsigned checkpoint = 0) {
         std::string query = run_wine({"sc", "query", name});
-        std::size_t at = query.find("CHECKPOINT");
         return query.find(state) != std::string::npos &&
-               (at == std::string::npos ||
-                std::stoul(query.substr(query.find("0x", at)), nullptr, 16) >= checkpoint);
+               (checkpoint == 0 ||
+                std::stoul(query.substr(query.find("0x", query.find("CHECKPOINT"))), nullptr, 16) >=
+                    checkpoint);
     };
     run_wine({"sc", "start", name});
     EXPECT_TRUE(becomes_true([&] { return in_state("RUNNING"); }));
