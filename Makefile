@@ -168,7 +168,8 @@ clean:
 # --- Windows: cross-built with mingw-w64, its tests run under Wine ------------
 WINDOWS_PACKAGES := g++-mingw-w64-x86-64-posix libboost$(BOOST)-dev googletest cmake ninja-build \
                     xz-utils
-WINE_PACKAGES := wine wine64
+# locales: the code page row builds a ja_JP locale of its own with localedef.
+WINE_PACKAGES := wine wine64 locales
 WIN := build-windows
 # Boost's headers through a folder that holds only boost/, and the source of
 # Boost.Filesystem's compiled part, which Debian builds for Linux only.
