@@ -48,6 +48,9 @@ class connection {
     bool execute(std::uint32_t channel, std::uint32_t flags, const std::vector<std::string>& items);
     // Bytes for a channel's standard input; close ends that input after them.
     bool send_stdin(std::uint32_t channel, std::string_view bytes, bool close = false);
+    // True when bytes already read wait here: receive() takes them before it
+    // reads again, so a wait for the link to be readable would miss them.
+    bool buffered() const { return !buffer_.empty(); }
     // Tells torvad the program serves: sent once, when it does.
     bool send_ready() { return send(0, packet_ready, 0); }
     // From now on a send gives up when torvad takes nothing for ms.

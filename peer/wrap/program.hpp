@@ -5,6 +5,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -38,13 +39,12 @@ struct stop_failure {
     const char* call = "";
 };
 stop_failure stop_program(const running_program& program);
-// Waits for the program's end: its status is its exit code, or 128 + the
-// signal that ended it, also named.
+// How the program ended: its status is its exit code, or 128 + the signal
+// that ended it, also named.
 struct program_end {
     int status = 0;
     int signal = 0;
 };
-program_end wait_for_program(const running_program& program);
 // The text of an error number, for a log line.
 std::string error_text(int error);
 
@@ -61,8 +61,25 @@ notify_socket open_notify_socket();
 long receive_notification(const notify_socket& socket, char* buffer, std::size_t size,
                           bool& too_long);
 
-// Our own stop requests (SIGTERM, SIGHUP; a console's close) call on_stop on
-// a thread of their own; Ctrl-C at the console is torvad's to act on.
-void watch_own_stop_requests(void (*on_stop)());
+// Holds our own stop requests (SIGTERM, SIGHUP; a console's close, a logoff,
+// a shutdown) from now on, for serve to hand over; Ctrl-C at the console is
+// torvad's to act on. Called first, before the program starts.
+void hold_own_stop_requests();
+
+// What serve hands over as it comes: on Linux every call is on serve's own
+// thread; on Windows the link is read on a thread of its own, and a stop
+// comes on the console's.
+struct handlers {
+    // The link has bytes: take them; false once it has ended.
+    std::function<bool()> on_link;
+    // A notify message waits: take it; false once the socket failed.
+    std::function<bool()> on_notification;
+    // We were asked to stop.
+    void (*on_stop)() = nullptr;
+};
+// Waits for the program's end, handing over until then what comes on the
+// link and the notify socket, and our own stop requests, held or new.
+program_end serve(const running_program& program, long link, const notify_socket& socket,
+                  const handlers& on);
 
 } // namespace torvad::wrap

@@ -3,13 +3,13 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
-#include <pthread.h>
+#include <optional>
+#include <poll.h>
 #include <spawn.h>
 #include <string_view>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <sys/wait.h>
-#include <thread>
 #include <unistd.h>
 
 #include "peer/wrap/program.hpp"
@@ -78,16 +78,6 @@ stop_failure stop_program(const running_program& program) {
     return {};
 }
 
-program_end wait_for_program(const running_program& program) {
-    int status = 0;
-    while (waitpid(static_cast<pid_t>(program.pid), &status, 0) == -1)
-        if (errno != EINTR)
-            return {128, 0};
-    if (WIFEXITED(status))
-        return {WEXITSTATUS(status), 0};
-    return {128 + WTERMSIG(status), WTERMSIG(status)};
-}
-
 std::string error_text(int error) {
     return std::strerror(error);
 }
@@ -122,19 +112,86 @@ long receive_notification(const notify_socket& socket, char* buffer, std::size_t
     }
 }
 
-void watch_own_stop_requests(void (*on_stop)()) {
+namespace {
+
+// Our stop requests and the program's end: blocked but while serve waits,
+// so that none is lost, and each only noted by its handler.
+sigset_t held_signals() {
+    sigset_t held;
+    sigemptyset(&held);
+    for (int number : {SIGTERM, SIGHUP, SIGCHLD})
+        sigaddset(&held, number);
+    return held;
+}
+
+volatile std::sig_atomic_t stop_asked = 0;
+void note_stop(int) {
+    stop_asked = 1;
+}
+// The end is read by reap itself: the signal only ends the wait.
+void note_end(int) {}
+
+// The program's end once it has ended; with WNOHANG nothing while it runs.
+std::optional<program_end> reap(const running_program& program, int options) {
+    int status = 0;
+    pid_t pid = waitpid(static_cast<pid_t>(program.pid), &status, options);
+    if (pid == 0 || (pid == -1 && errno == EINTR))
+        return std::nullopt;
+    if (pid == -1)
+        return program_end{128, 0};
+    if (WIFEXITED(status))
+        return program_end{WEXITSTATUS(status), 0};
+    return program_end{128 + WTERMSIG(status), WTERMSIG(status)};
+}
+
+} // namespace
+
+void hold_own_stop_requests() {
     signal(SIGINT, SIG_IGN);
-    sigset_t stops;
-    sigemptyset(&stops);
-    sigaddset(&stops, SIGTERM);
-    sigaddset(&stops, SIGHUP);
-    // Blocked before any thread starts, so that only the watcher takes them.
-    pthread_sigmask(SIG_BLOCK, &stops, nullptr);
-    std::thread([stops, on_stop] {
-        for (int number = 0;;)
-            if (sigwait(&stops, &number) == 0)
-                on_stop();
-    }).detach();
+    sigset_t held = held_signals();
+    sigprocmask(SIG_BLOCK, &held, nullptr);
+    struct sigaction stop {
+    }, end{};
+    stop.sa_handler = note_stop;
+    end.sa_handler = note_end;
+    sigaction(SIGTERM, &stop, nullptr);
+    sigaction(SIGHUP, &stop, nullptr);
+    sigaction(SIGCHLD, &end, nullptr);
+}
+
+// One thread waits for everything, so that the wrapper starts and ends as a
+// single thread does: a restart through it costs little more than a
+// process's start and end. The held signals come in only during ppoll, whose
+// wait they end.
+program_end serve(const running_program& program, long link, const notify_socket& socket,
+                  const handlers& on) {
+    sigset_t waiting;
+    sigprocmask(SIG_SETMASK, nullptr, &waiting);
+    for (int number : {SIGTERM, SIGHUP, SIGCHLD})
+        sigdelset(&waiting, number);
+    pollfd waits[] = {{static_cast<int>(link), POLLIN, 0},
+                      {static_cast<int>(socket.fd), POLLIN, 0}};
+    for (;;) {
+        if (auto end = reap(program, WNOHANG))
+            return *end;
+        if (stop_asked) {
+            stop_asked = 0;
+            on.on_stop();
+        }
+        if (ppoll(waits, 2, nullptr, &waiting) == -1) {
+            // Interrupted by a held signal, noted above; past any other
+            // failure the wrapper can still end with its program.
+            if (errno == EINTR)
+                continue;
+            for (;;)
+                if (auto end = reap(program, 0))
+                    return *end;
+        }
+        if (waits[0].revents != 0 && !on.on_link())
+            waits[0].fd = -1;
+        if (waits[1].revents != 0 && !on.on_notification())
+            waits[1].fd = -1;
+    }
 }
 
 } // namespace torvad::wrap

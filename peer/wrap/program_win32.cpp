@@ -1,7 +1,9 @@
 #include <windows.h>
 
+#include <atomic>
 #include <csignal>
 #include <cstdint>
+#include <thread>
 
 #include "peer/wrap/program.hpp"
 
@@ -48,14 +50,29 @@ void own_a_console() {
     SetStdHandle(STD_ERROR_HANDLE, streams[2]);
 }
 
-void (*stop_request)() = nullptr;
+// Where a stop goes once serve runs; until then one is held.
+std::atomic<void (*)()> stop_request = nullptr;
+std::atomic<bool> stop_held = false;
 
 // Ctrl-C and Ctrl-Break at torvad's console are torvad's to act on; the
 // console's close, a logoff or a shutdown stops the program.
 BOOL WINAPI on_console_event(DWORD event) {
-    if (event != CTRL_C_EVENT && event != CTRL_BREAK_EVENT && stop_request != nullptr)
-        stop_request();
+    if (event == CTRL_C_EVENT || event == CTRL_BREAK_EVENT)
+        return TRUE;
+    // Whichever of us and serve takes the held stop sends it: once.
+    stop_held = true;
+    if (auto stop = stop_request.load(); stop != nullptr && stop_held.exchange(false))
+        stop();
     return TRUE;
+}
+
+program_end wait_for_program(const running_program& program) {
+    DWORD code = 0;
+    if (WaitForSingleObject(handle_of(program.handle), INFINITE) != WAIT_OBJECT_0 ||
+        !GetExitCodeProcess(handle_of(program.handle), &code))
+        return {128, 0};
+    int status = static_cast<int>(code);
+    return {status, code == STATUS_CONTROL_C_EXIT ? program.stop_signal : 0};
 }
 
 } // namespace
@@ -109,15 +126,6 @@ stop_failure stop_program(const running_program& program) {
     return {};
 }
 
-program_end wait_for_program(const running_program& program) {
-    DWORD code = 0;
-    if (WaitForSingleObject(handle_of(program.handle), INFINITE) != WAIT_OBJECT_0 ||
-        !GetExitCodeProcess(handle_of(program.handle), &code))
-        return {128, 0};
-    int status = static_cast<int>(code);
-    return {status, code == STATUS_CONTROL_C_EXIT ? program.stop_signal : 0};
-}
-
 std::string error_text(int error) {
     char text[512] = {};
     if (FormatMessageA(FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS, nullptr,
@@ -139,9 +147,21 @@ long receive_notification(const notify_socket&, char*, std::size_t, bool& too_lo
     return -1;
 }
 
-void watch_own_stop_requests(void (*on_stop)()) {
-    stop_request = on_stop;
+void hold_own_stop_requests() {
     SetConsoleCtrlHandler(on_console_event, TRUE);
+}
+
+// The link is read on a thread of its own, blocked in its reads to the end:
+// the process's exit ends it. There is no notify socket to read here.
+program_end serve(const running_program& program, long, const notify_socket&, const handlers& on) {
+    stop_request = on.on_stop;
+    if (stop_held.exchange(false))
+        on.on_stop();
+    std::thread([on_link = on.on_link] {
+        while (on_link()) {
+        }
+    }).detach();
+    return wait_for_program(program);
 }
 
 } // namespace torvad::wrap

@@ -9,7 +9,6 @@
 #include <cstring>
 #include <string>
 #include <string_view>
-#include <thread>
 #include <vector>
 
 #include "peer/peer.hpp"
@@ -50,8 +49,9 @@ bool scan(int argc, char** argv, wrap_options& out) {
     return out.stop_signal > 0 && !out.command.empty();
 }
 
-// What the stop requests share with the end: the program once started, and
-// the signal once one was sent to stop it.
+// What a stop shares with the end: the program once started, and the signal
+// once one was sent to stop it. A stop may come on a thread of its own (a
+// Windows console's), hence the atomics.
 wrap::running_program program;
 std::atomic<bool> started = false;
 std::atomic<int> stop_sent = 0;
@@ -67,42 +67,49 @@ void stop() {
                      wrap::error_text(failed.error).c_str());
 }
 
-// The version, first, is passed over like any packet but sigterm: the
-// program starts without waiting for it. Every sigterm stops it again; the
-// end of the pipe means torvad is gone, and the program is stopped the same
-// way rather than left behind.
-void follow_link(peer::connection& link) {
+// Takes what the link holds: the version, first, is passed over like any
+// packet but sigterm, since the program starts without waiting for it. Every
+// sigterm stops it again; the end of the pipe means torvad is gone, and the
+// program is stopped the same way rather than left behind. False at the end.
+bool take_packets(peer::connection& link) {
     peer::packet packet;
-    while (link.receive(packet))
+    do {
+        if (!link.receive(packet)) {
+            std::fprintf(stderr, "torvad-wrap: torvad's pipe closed; stopping the program.\n");
+            stop();
+            return false;
+        }
         if (packet.header.type == packet_sigterm && packet.header.channel == 0)
             stop();
-    std::fprintf(stderr, "torvad-wrap: torvad's pipe closed; stopping the program.\n");
-    stop();
+    } while (link.buffered());
+    return true;
 }
 
 // A message is lines of NAME=value; READY=1 among them is the one we act on,
-// the first time. One too long for the buffer is dropped whole, as systemd does.
-void follow_notifications(const wrap::notify_socket& socket, peer::connection& link) {
+// the first time. One too long for the buffer is dropped whole, as systemd
+// does. False once the socket fails.
+bool take_notification(const wrap::notify_socket& socket, peer::connection& link, bool& ready) {
     char buffer[4096];
-    bool ready = false, too_long = false;
-    for (long got;
-         (got = wrap::receive_notification(socket, buffer, sizeof buffer, too_long)) >= 0;) {
-        if (too_long) {
-            std::fprintf(stderr, "torvad-wrap: a notify message of %ld bytes ignored.\n", got);
-            continue;
-        }
-        std::string_view message(buffer, static_cast<std::size_t>(got));
-        for (std::size_t at = 0, end; !ready && at <= message.size(); at = end + 1) {
-            end = std::min(message.find('\n', at), message.size());
-            ready = message.substr(at, end - at) == "READY=1" && link.send_ready();
-        }
+    bool too_long = false;
+    long got = wrap::receive_notification(socket, buffer, sizeof buffer, too_long);
+    if (got < 0)
+        return false;
+    if (too_long) {
+        std::fprintf(stderr, "torvad-wrap: a notify message of %ld bytes ignored.\n", got);
+        return true;
     }
+    std::string_view message(buffer, static_cast<std::size_t>(got));
+    for (std::size_t at = 0, end; !ready && at <= message.size(); at = end + 1) {
+        end = std::min(message.find('\n', at), message.size());
+        ready = message.substr(at, end - at) == "READY=1" && link.send_ready();
+    }
+    return true;
 }
 
 [[noreturn]] void end_with(int status) {
     std::fflush(nullptr);
-    // The reading threads still use the link on run's stack: end without
-    // unwinding anything.
+    // A reader of the link may still be blocked on a thread of its own
+    // (Windows): end without unwinding anything.
     std::_Exit(status);
 }
 
@@ -111,7 +118,7 @@ int run(int argc, char** argv) {
     int fd = peer::ipc_fd_from_arguments(argc, argv);
     if (fd < 0 || !scan(argc, argv, options))
         return std::fputs(usage, stderr), 2;
-    wrap::watch_own_stop_requests(stop);
+    wrap::hold_own_stop_requests();
     wrap::keep_link_from_program(fd);
     peer::connection link(fd);
     wrap::notify_socket socket;
@@ -131,13 +138,13 @@ int run(int argc, char** argv) {
     started = true;
     if (options.ready_at_once)
         link.send_ready();
-    // Both threads block in reads to the end: the process's exit ends them.
-    std::thread([&link] { follow_link(link); }).detach();
-    if (socket.fd >= 0)
-        std::thread([&socket, &link] { follow_notifications(socket, link); }).detach();
+    bool ready = false;
+    wrap::handlers handlers{
+        [&link] { return take_packets(link); },
+        [&socket, &link, &ready] { return take_notification(socket, link, ready); }, stop};
+    wrap::program_end end = wrap::serve(program, fd, socket, handlers);
     // A program ended by the very signal sent to stop it has ended cleanly,
     // as service managers count it.
-    wrap::program_end end = wrap::wait_for_program(program);
     end_with(end.signal != 0 && end.signal == stop_sent ? 0 : end.status);
 }
 
