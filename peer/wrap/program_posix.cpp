@@ -150,10 +150,10 @@ void hold_own_stop_requests() {
     signal(SIGINT, SIG_IGN);
     sigset_t held = held_signals();
     sigprocmask(SIG_BLOCK, &held, nullptr);
-    struct sigaction stop {
-    }, end{};
+    struct sigaction stop = {}, end = {};
     stop.sa_handler = note_stop;
     end.sa_handler = note_end;
+    end.sa_flags = SA_NOCLDSTOP; // a program stopped at the terminal hasn't ended
     sigaction(SIGTERM, &stop, nullptr);
     sigaction(SIGHUP, &stop, nullptr);
     sigaction(SIGCHLD, &end, nullptr);
@@ -166,7 +166,7 @@ void hold_own_stop_requests() {
 program_end serve(const running_program& program, long link, const notify_socket& socket,
                   const handlers& on) {
     sigset_t waiting;
-    sigprocmask(SIG_SETMASK, nullptr, &waiting);
+    sigprocmask(SIG_BLOCK, nullptr, &waiting);
     for (int number : {SIGTERM, SIGHUP, SIGCHLD})
         sigdelset(&waiting, number);
     pollfd waits[] = {{static_cast<int>(link), POLLIN, 0},
