@@ -67,6 +67,11 @@ TEST(wrap, programs_stopped_their_own_way_and_ready_at_their_word) {
           "/proc/$PPID/stat); sleep 30 & wait"},
          {"#top pid", "kill 9", "?torvad's pipe closed; stopping the program.", "?program stopped"},
          managed},
+        // so does the wrapper's own SIGTERM; its status 0 ends the run, the last child gone
+        {{"--", wrap_binary, "sh", "-c",
+          "trap 'echo program stopped; exit 0' TERM; echo wrapper pid=$PPID; sleep 30 & wait"},
+         {"#wrapper pid", "kill 15", "?program stopped", wrapped_0, "=0", "-again"},
+         on_linux},
     });
 }
 
