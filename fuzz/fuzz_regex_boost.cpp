@@ -18,6 +18,7 @@
 #include <boost/regex.hpp>
 
 #include "fuzz/quick_library.hpp"
+#include "fuzz/shown.hpp"
 #include "matcher/automaton.hpp"
 #include "platform/platform.hpp"
 
@@ -45,16 +46,6 @@ std::string boost_answer(const std::string& pattern, const std::string& text) {
         // Its bound on states, or on the memory of its backtracking stack.
         return std::string("undecided: ") + failure.what();
     }
-}
-
-std::string shown(const std::string& bytes) {
-    std::string out;
-    for (unsigned char c : bytes) {
-        char hex[5];
-        std::snprintf(hex, sizeof hex, "\\x%02x", c);
-        out += c >= 0x20 && c < 0x7f && c != '\\' ? std::string(1, static_cast<char>(c)) : hex;
-    }
-    return out;
 }
 
 void report(const std::string& pattern, const std::string& text, bool library,

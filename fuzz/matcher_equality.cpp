@@ -17,6 +17,7 @@
 #include <string>
 #include <vector>
 
+#include "fuzz/shown.hpp"
 #include "matcher/automaton.hpp"
 #include "matcher/scanner.hpp"
 
@@ -191,16 +192,6 @@ std::string difference(const std::optional<automaton>& ours,
         ours->has_backrefs != library->has_backrefs)
         return "word set, start, groups, repeats or back-references";
     return {};
-}
-
-std::string shown(const std::string& line) {
-    std::string out;
-    for (unsigned char c : line) {
-        char hex[8];
-        std::snprintf(hex, sizeof hex, "\\x%02x", c);
-        out += c >= 0x20 && c < 0x7f && c != '\\' ? std::string(1, static_cast<char>(c)) : hex;
-    }
-    return out;
 }
 
 struct tally {
